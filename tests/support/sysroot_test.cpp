@@ -1,0 +1,81 @@
+#include "support/sysroot_test.h"
+
+#include <fileindex/error.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+
+namespace {
+void MakeDirs(const std::string& path) {
+  for (size_t pos = path.find('/', 1);; pos = path.find('/', pos + 1)) {
+    ::mkdir(path.substr(0, pos).c_str(), 0755);
+    if (pos == std::string::npos) break;
+  }
+}
+}  // namespace
+
+void SysrootTest::SetUp() {
+  char tmpl[] = "/tmp/fileindex-test-XXXXXX";
+  ASSERT_NE(::mkdtemp(tmpl), nullptr);
+  root_ = tmpl;
+  ::setenv("FILEINDEX_SYSROOT", root_.c_str(), 1);
+  MakeDirs(root_ + "/usr/tavo/etc/fileindex");
+  MakeDirs(root_ + "/tmp");
+  MakeDirs(root_ + "/var/run");
+  fake::Reset();
+  logcap::Clear();
+  TAVO::FILEINDEX::LOG_LEVEL = 3;
+  TAVO::FILEINDEX::ErrorHandler::g_error_code = TAVO::FILEINDEX::FILEINDEX_ERR_NONE;
+}
+
+void SysrootTest::TearDown() {
+  if (!root_.empty() && root_.compare(0, 20, "/tmp/fileindex-test-") == 0) {
+    std::string cmd = "rm -rf '" + root_ + "'";
+    if (std::system(cmd.c_str()) != 0) ADD_FAILURE() << "cannot remove " << root_;
+  }
+  ::unsetenv("FILEINDEX_SYSROOT");
+}
+
+fake::Share& SysrootTest::AddShare(const std::string& name, const std::string& volume) {
+  return fake::AddShare(root_, volume, name);
+}
+
+void SysrootTest::WriteFile(const std::string& path, const std::string& content) {
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  out << content;
+  ASSERT_TRUE(static_cast<bool>(out)) << path;
+}
+
+std::string SysrootTest::ReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+bool SysrootTest::Exists(const std::string& path) {
+  struct stat st;
+  return ::lstat(path.c_str(), &st) == 0;
+}
+
+Json::Value SysrootTest::ParseJson(const std::string& text) {
+  Json::CharReaderBuilder builder;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value value;
+  std::string errors;
+  EXPECT_TRUE(reader->parse(text.data(), text.data() + text.size(), &value, &errors)) << text << ": " << errors;
+  return value;
+}
+
+Json::Value SysrootTest::ReadJson(const std::string& path) { return ParseJson(ReadFile(path)); }
+
+std::vector<std::string> SysrootTest::ReadLines(const std::string& path) {
+  std::vector<std::string> lines;
+  std::ifstream in(path);
+  std::string line;
+  while (std::getline(in, line)) lines.push_back(line);
+  return lines;
+}

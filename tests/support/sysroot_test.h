@@ -1,0 +1,43 @@
+// The fixture every unit test derives from: a fresh temporary system root (with the
+// configuration, lock and socket directories), a reset fake platform, an empty log
+// capture, LOG_LEVEL 3 and error code 0.
+#ifndef FILEINDEX_TESTS_SYSROOT_TEST_H
+#define FILEINDEX_TESTS_SYSROOT_TEST_H
+
+#include <gtest/gtest.h>
+#include <json/json.h>
+
+#include <string>
+#include <vector>
+
+#include "support/fake_platform.h"
+#include "support/log_capture.h"
+
+class SysrootTest : public ::testing::Test {
+ protected:
+  void SetUp() override;
+  void TearDown() override;
+
+  // <root><path>
+  std::string Rooted(const std::string& path) const { return root_ + path; }
+  std::string FolderConfPath() const { return Rooted("/usr/tavo/etc/fileindex/folder.conf"); }
+  std::string StatusConfPath() const { return Rooted("/usr/tavo/etc/fileindex/status.conf"); }
+  std::string SocketPath() const { return Rooted("/var/run/fileindexd.sock"); }
+
+  // Adds share name in <root><volume>/<name>.
+  fake::Share& AddShare(const std::string& name, const std::string& volume = "/volume1");
+
+  // File helpers.
+  static void WriteFile(const std::string& path, const std::string& content);
+  static std::string ReadFile(const std::string& path);
+  static bool Exists(const std::string& path);
+  // Parses a file with JsonCpp; fails the test when it does not parse.
+  static Json::Value ReadJson(const std::string& path);
+  static Json::Value ParseJson(const std::string& text);
+  // The lines of a text file, without their newlines.
+  static std::vector<std::string> ReadLines(const std::string& path);
+
+  std::string root_;
+};
+
+#endif
