@@ -1,0 +1,87 @@
+// Where each share keeps its event queue and its index database: inside the share's
+// "@eaDir" directory. These C entry points report through the platform's error channel
+// only, and their log lines do not consult LOG_LEVEL.
+#include <fileindex/fileindex_c.h>
+#include <sys/stat.h>
+#include <tavo/platform.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+
+#include "internal/log.h"
+#include "internal/share_record.h"
+
+namespace {
+const char kLogUnit[] = "utils";
+const int kFullPathSize = 4096;
+const int kBadArgumentError = 0xD00;
+const char kEaDirName[] = "@eaDir";
+const char kQueueFileName[] = "TAVO@file_index_queue";
+const char kDbDirName[] = "TAVO@.fileindexdb";
+
+// Logs the failed condition and records it on the platform error channel, both with the
+// line of the check.
+#define FIDX_BAD_ARGUMENT(text)                            \
+  do {                                                     \
+    FIDX_LOG_RAW("Invaild Argument (%s)=[%d]\n", text, 0); \
+    VLIBCErrSetEx(kBadArgumentError, kLogUnit, __LINE__);  \
+  } while (0)
+
+// The "@eaDir" of the share is made (best effort) and the path written into the caller's
+// buffer, cut as snprintf cuts it. The share record is freed on every way out.
+int SharePathGet(const char* name, char* out, int outLen, const char* lastComponent) {
+  TAVO::FILEINDEX::internal::ShareRecord record;
+  if (TAVO::FILEINDEX::internal::GetShareRecord(name, record) < 0) {
+    FIDX_LOG_RAW("TAVOShareGet failed, name=%s, code=%d", name, VLIBCErrGet());
+    return -1;
+  }
+  const char* shareDir = record->szPath != nullptr ? record->szPath : "";
+  char eaDir[kFullPathSize];
+  std::memset(eaDir, 0, sizeof(eaDir));
+  std::snprintf(eaDir, sizeof(eaDir), "%s/%s", shareDir, kEaDirName);
+  if (TAVOEAMKDir(0, eaDir) < 0) {
+    FIDX_LOG_RAW("TAVOEAMKDir failed, path=%s, code=%d", eaDir, VLIBCErrGet());
+  }
+  std::snprintf(out, static_cast<size_t>(outLen), "%s/%s/%s", shareDir, kEaDirName, lastComponent);
+  return static_cast<int>(std::strlen(out));
+}
+}  // namespace
+
+int FILEIDXQueuePathGet(const char* szName, char* szOutQueuePath, int cbOutLen) {
+  if (szName == nullptr) {
+    FIDX_BAD_ARGUMENT("__null != szName");
+    return -1;
+  }
+  if (szOutQueuePath == nullptr) {
+    FIDX_BAD_ARGUMENT("__null != szOutQueuePath");
+    return -1;
+  }
+  if (!(cbOutLen > 0)) {
+    FIDX_BAD_ARGUMENT("cbOutLen > 0");
+    return -1;
+  }
+  return SharePathGet(szName, szOutQueuePath, cbOutLen, kQueueFileName);
+}
+
+int FILEIDXDBPathGet(const char* szName, char* szOutDBPath, int cbOutLen) {
+  if (szName == nullptr) {
+    FIDX_BAD_ARGUMENT("__null != szName");
+    return -1;
+  }
+  if (szOutDBPath == nullptr) {
+    FIDX_BAD_ARGUMENT("__null != szOutDBPath");
+    return -1;
+  }
+  if (!(cbOutLen > 0)) {
+    FIDX_BAD_ARGUMENT("cbOutLen > 0");
+    return -1;
+  }
+  int length = SharePathGet(szName, szOutDBPath, cbOutLen, kDbDirName);
+  if (length < 0) return length;
+  // Another process making the same directory at the same time is harmless.
+  if (::mkdir(szOutDBPath, 0777) != 0 && errno != EEXIST) {
+    FIDX_LOG_RAW("mkdir failed, path=%s, reason=%m", szOutDBPath);
+  }
+  return length;
+}
