@@ -182,6 +182,8 @@ TEST_F(FoundationTest, JsonTextHelpersAreStrictAndCompact) {
   EXPECT_FALSE(internal::JsonFromString(value, "// c\n{}"));
   EXPECT_FALSE(internal::JsonFromString(value, ""));
   EXPECT_TRUE(internal::JsonFromString(value, "5"));
+  // Deeper than the parser's stack limit: refused, never thrown.
+  EXPECT_FALSE(internal::JsonFromString(value, std::string(5000, '[') + std::string(5000, ']')));
 }
 
 TEST_F(FoundationTest, ShareNameComesFromTheFirstComponentAfterIndexZero) {

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <exception>
 #include <memory>
 
 namespace TAVO {
@@ -91,7 +92,12 @@ bool JsonFromString(Json::Value& out, const std::string& text) {
   Json::Value parsed;
   const char* begin = text.data();
   if (HasSlashOutsideStrings(begin, begin + text.size())) return false;
-  if (!reader->parse(begin, begin + text.size(), &parsed, nullptr)) return false;
+  // JsonCpp throws instead of failing on documents nested deeper than its stack limit.
+  try {
+    if (!reader->parse(begin, begin + text.size(), &parsed, nullptr)) return false;
+  } catch (const std::exception&) {
+    return false;
+  }
   out.swap(parsed);
   return true;
 }
