@@ -41,6 +41,9 @@ class Folder {
   bool IsPhoto() const { return m_blPhoto; }
 
  private:
+  // The collection loads many records at once and resolves each share only once.
+  friend class Folders;
+
   std::string m_strFullPath;
   std::string m_strPath;
   std::string m_strName;
