@@ -2,14 +2,15 @@
 //   {"shares": [{"name": "photo", "path": "/volume1/photo", "readonly": false,
 //                "encrypted": false, "encryption": false, "recycle_bin": true}]}
 // Share directories are rooted like every other fixed path.
+#include <json/json.h>
 #include <sys/stat.h>
 #include <tavo/platform.h>
 
 #include <cstdlib>
 #include <cstring>
-#include <fstream>
+#include <memory>
 #include <mutex>
-#include <sstream>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -20,33 +21,79 @@ namespace tavo_host {
 
 namespace {
 
-std::mutex g_mutex;
-std::vector<ShareInfo> g_shares;
-std::string g_loadedPath;
-struct timespec g_loadedMtime = {0, 0};
-off_t g_loadedSize = -1;
-ino_t g_loadedIno = 0;
+struct TableCache {
+  std::mutex mutex;
+  std::vector<ShareInfo> shares;
+  std::string path;
+  struct stat st = {};
+  bool valid = false;
+};
+
+TableCache& Cache() {
+  static TableCache* cache = new TableCache();  // never destroyed: used until exit
+  return *cache;
+}
+
+bool SameFile(const struct stat& a, const struct stat& b) {
+  return a.st_dev == b.st_dev && a.st_ino == b.st_ino && a.st_size == b.st_size &&
+         a.st_mtim.tv_sec == b.st_mtim.tv_sec && a.st_mtim.tv_nsec == b.st_mtim.tv_nsec &&
+         a.st_ctim.tv_sec == b.st_ctim.tv_sec && a.st_ctim.tv_nsec == b.st_ctim.tv_nsec;
+}
+
+bool ReadFlag(const Json::Value& entry, const char* key, bool& out) {
+  if (!entry.isMember(key)) return true;
+  if (!entry[key].isBool()) return false;
+  out = entry[key].asBool();
+  return true;
+}
+
+// A share directory as stored: absolute, no empty, "." or ".." component, no trailing slash.
+bool NormalisedDirectory(const std::string& in, std::string& out) {
+  if (in.empty() || in[0] != '/') return false;
+  out.clear();
+  size_t start = 1;
+  while (start <= in.size()) {
+    size_t end = in.find('/', start);
+    if (end == std::string::npos) end = in.size();
+    std::string part = in.substr(start, end - start);
+    if (part == "." || part == "..") return false;
+    if (!part.empty()) out += "/" + part;
+    start = end + 1;
+  }
+  return !out.empty();
+}
 
 bool ParseTable(const std::string& text, std::vector<ShareInfo>& out) {
   Json::CharReaderBuilder builder;
-  std::string errors;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value root;
-  std::istringstream in(text);
-  if (!Json::parseFromStream(builder, in, &root, &errors)) return false;
-  const Json::Value& list = root.isObject() ? root["shares"] : root;
-  if (!list.isArray()) return false;
-  out.clear();
-  for (const Json::Value& entry : list) {
+  std::string errors;
+  if (!reader->parse(text.data(), text.data() + text.size(), &root, &errors)) return false;
+  if (!root.isObject() || !root["shares"].isArray()) return false;
+  std::vector<ShareInfo> parsed;
+  std::set<std::string> names;
+  for (const Json::Value& entry : root["shares"]) {
     if (!entry.isObject() || !entry["name"].isString() || !entry["path"].isString()) return false;
     ShareInfo info;
     info.name = entry["name"].asString();
-    info.path = Rooted(entry["path"].asString());
-    info.readOnly = entry.get("readonly", false).asBool();
-    info.encrypted = entry.get("encrypted", false).asBool();
-    info.encryption = entry.get("encryption", false).asBool();
-    info.recycleBin = entry.get("recycle_bin", false).asBool();
-    out.push_back(info);
+    std::string dir;
+    if (info.name.empty() || info.name.find('/') != std::string::npos || !names.insert(info.name).second ||
+        !NormalisedDirectory(entry["path"].asString(), dir)) {
+      return false;
+    }
+    info.path = Rooted(dir);
+    if (!ReadFlag(entry, "readonly", info.readOnly) || !ReadFlag(entry, "encrypted", info.encrypted) ||
+        !ReadFlag(entry, "encryption", info.encryption) || !ReadFlag(entry, "recycle_bin", info.recycleBin)) {
+      return false;
+    }
+    if (entry.isMember("free_bytes")) {
+      if (!entry["free_bytes"].isIntegral() || entry["free_bytes"].asLargestInt() < 0) return false;
+      info.freeBytes = entry["free_bytes"].asLargestInt();
+    }
+    parsed.push_back(info);
   }
+  out.swap(parsed);
   return true;
 }
 
@@ -55,32 +102,28 @@ bool ParseTable(const std::string& text, std::vector<ShareInfo>& out) {
 std::string ShareTablePath() { return Rooted("/etc/tavo/shares.json"); }
 
 bool LoadShares(std::vector<ShareInfo>& out) {
-  std::lock_guard<std::mutex> guard(g_mutex);
+  TableCache& cache = Cache();
+  std::lock_guard<std::mutex> guard(cache.mutex);
   const std::string path = ShareTablePath();
   struct stat st;
   if (::stat(path.c_str(), &st) != 0) {
     TAVO_HOST_SET_ERROR(kErrShareTable);
     return false;
   }
-  // Re-read only when the file changed.
-  bool same = path == g_loadedPath && st.st_ino == g_loadedIno && st.st_size == g_loadedSize &&
-              st.st_mtim.tv_sec == g_loadedMtime.tv_sec && st.st_mtim.tv_nsec == g_loadedMtime.tv_nsec;
-  if (!same) {
-    std::ifstream in(path);
-    std::stringstream text;
-    text << in.rdbuf();
+  if (!cache.valid || cache.path != path || !SameFile(cache.st, st)) {
+    std::string text;
     std::vector<ShareInfo> parsed;
-    if (!in || !ParseTable(text.str(), parsed)) {
+    if (!ReadFile(path, text) || !ParseTable(text, parsed)) {
+      cache.valid = false;
       TAVO_HOST_SET_ERROR(kErrShareTable);
       return false;
     }
-    g_shares.swap(parsed);
-    g_loadedPath = path;
-    g_loadedIno = st.st_ino;
-    g_loadedSize = st.st_size;
-    g_loadedMtime = st.st_mtim;
+    cache.shares.swap(parsed);
+    cache.path = path;
+    cache.st = st;
+    cache.valid = true;
   }
-  out = g_shares;
+  out = cache.shares;
   return true;
 }
 
@@ -97,10 +140,12 @@ bool FindShare(const std::string& name, ShareInfo& out) {
   return false;
 }
 
+bool IsUnder(const std::string& full, const std::string& dir) {
+  return full.compare(0, dir.size(), dir) == 0 && (full.size() == dir.size() || full[dir.size()] == '/');
+}
+
 bool NameMatchesDirectory(const ShareInfo& share) {
-  std::string::size_type slash = share.path.rfind('/');
-  std::string last = slash == std::string::npos ? share.path : share.path.substr(slash + 1);
-  return last == share.name;
+  return share.path.substr(share.path.rfind('/') + 1) == share.name;
 }
 
 bool FindShareOfPath(const std::string& full, ShareInfo& out) {
@@ -108,10 +153,8 @@ bool FindShareOfPath(const std::string& full, ShareInfo& out) {
   if (!LoadShares(shares)) return false;
   const ShareInfo* best = nullptr;
   for (const ShareInfo& share : shares) {
-    const std::string& dir = share.path;
-    bool inside = full.compare(0, dir.size(), dir) == 0 &&
-                  (full.size() == dir.size() || full[dir.size()] == '/');
-    if (inside && (best == nullptr || dir.size() > best->path.size())) best = &share;
+    if (IsUnder(full, share.path) && (best == nullptr || share.path.size() > best->path.size()))
+      best = &share;
   }
   if (best == nullptr) {
     TAVO_HOST_SET_ERROR(kErrNoSuchShare);
@@ -133,8 +176,6 @@ extern "C" int TAVOShareGet(const char* szName, PTAVOSHARE* ppShare) {
   ShareInfo info;
   if (!tavo_host::FindShare(szName, info)) return -1;
   if (!tavo_host::NameMatchesDirectory(info)) {
-    // The library builds full paths from the volume and the share name, so a share
-    // whose directory is named otherwise cannot be served.
     TAVO_HOST_SET_ERROR(tavo_host::kErrShareNameMismatch);
     return -1;
   }
@@ -146,6 +187,11 @@ extern "C" int TAVOShareGet(const char* szName, PTAVOSHARE* ppShare) {
   share->szName = ::strdup(info.name.c_str());
   share->szComment = ::strdup("");
   share->szPath = ::strdup(info.path.c_str());
+  if (share->szName == nullptr || share->szComment == nullptr || share->szPath == nullptr) {
+    TAVOShareFree(share);
+    TAVO_HOST_SET_ERROR(tavo_host::kErrSystem);
+    return -1;
+  }
   share->blReadOnly = info.readOnly;
   share->blEncrypted = info.encrypted;
   share->blEncryption = info.encryption;
@@ -183,38 +229,34 @@ extern "C" int TAVOShareNamePathGet(const char* szFullPath, char* szName, int cb
   return 0;
 }
 
+// Non-zero for the share's "#recycle" directory and what lies below it, when the
+// share's recycle bin is on.
 extern "C" int TAVOShareIsShareRecycle(const char* szFullPath) {
   if (szFullPath == nullptr) return 0;
   ShareInfo info;
   if (!tavo_host::FindShareOfPath(szFullPath, info) || !info.recycleBin) return 0;
-  const std::string top = info.path + "/#recycle";
-  const std::string full = szFullPath;
-  return full.compare(0, top.size(), top) == 0 && (full.size() == top.size() || full[top.size()] == '/');
+  return tavo_host::IsUnder(szFullPath, info.path + "/#recycle") ? 1 : 0;
 }
 
-extern "C" int VLIBShareIsEncryptedGet(PTAVOSHARE pShare, int* pblEncrypted) {
-  if (pShare == nullptr || pblEncrypted == nullptr) {
+namespace {
+int GetFlag(PTAVOSHARE share, int* out, int TAVOSHARE::*member) {
+  if (share == nullptr || out == nullptr) {
     TAVO_HOST_SET_ERROR(tavo_host::kErrBadArgument);
     return -1;
   }
-  *pblEncrypted = pShare->blEncrypted;
+  *out = share->*member;
   return 0;
+}
+}  // namespace
+
+extern "C" int VLIBShareIsEncryptedGet(PTAVOSHARE pShare, int* pblEncrypted) {
+  return GetFlag(pShare, pblEncrypted, &TAVOSHARE::blEncrypted);
 }
 
 extern "C" int VLIBShareIsEncryptionGet(PTAVOSHARE pShare, int* pblEncryption) {
-  if (pShare == nullptr || pblEncryption == nullptr) {
-    TAVO_HOST_SET_ERROR(tavo_host::kErrBadArgument);
-    return -1;
-  }
-  *pblEncryption = pShare->blEncryption;
-  return 0;
+  return GetFlag(pShare, pblEncryption, &TAVOSHARE::blEncryption);
 }
 
 extern "C" int VLIBShareIsReadOnlyGet(PTAVOSHARE pShare, int* pblReadOnly) {
-  if (pShare == nullptr || pblReadOnly == nullptr) {
-    TAVO_HOST_SET_ERROR(tavo_host::kErrBadArgument);
-    return -1;
-  }
-  *pblReadOnly = pShare->blReadOnly;
-  return 0;
+  return GetFlag(pShare, pblReadOnly, &TAVOSHARE::blReadOnly);
 }
