@@ -1,9 +1,18 @@
 #!/usr/bin/env bash
-# Installs the dependencies, configures, builds and runs the whole test suite.
+# Installs the dependencies, configures, builds and runs the whole test suite, then the
+# same suite again built with AddressSanitizer and UndefinedBehaviorSanitizer.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 bash scripts/install-deps.sh
 BUILD_DIR=${BUILD_DIR:-build}
+jobs=$(nproc)
 cmake -S . -B "$BUILD_DIR" -DCMAKE_BUILD_TYPE=RelWithDebInfo
-cmake --build "$BUILD_DIR" -j"$(nproc)"
-ctest --test-dir "$BUILD_DIR" --output-on-failure -j"$(nproc)"
+cmake --build "$BUILD_DIR" -j"$jobs"
+ctest --test-dir "$BUILD_DIR" --output-on-failure -j"$jobs"
+
+if [ "${FILEINDEX_SKIP_SANITIZERS:-0}" != 1 ]; then
+  cmake -S . -B "$BUILD_DIR-sanitize" -DCMAKE_BUILD_TYPE=Debug -DFILEINDEX_SANITIZE=ON
+  cmake --build "$BUILD_DIR-sanitize" -j"$jobs"
+  ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1 \
+    ctest --test-dir "$BUILD_DIR-sanitize" --output-on-failure -j"$jobs"
+fi
