@@ -6,8 +6,8 @@
 #include <fileindex/utils.h>
 
 #include <cstdint>
+#include <cstring>
 #include <ctime>
-#include <exception>
 #include <set>
 #include <string>
 #include <vector>
@@ -49,10 +49,11 @@ bool IsPaused(long long resumeTime) {
 
 // Whether "path" + "/" starts with folder + "/": the event concerns the folder itself or
 // something inside it, on whole path components. folderSlash already ends in "/".
-bool LiesIn(const char* path, size_t size, const std::string& folderSlash) {
+inline bool LiesIn(const char* path, size_t size, const std::string& folderSlash) {
   const size_t n = folderSlash.size() - 1;
-  if (size < n || folderSlash.compare(0, n, path, n) != 0) return false;
-  return size == n || path[n] == '/';
+  // The byte after the folder's length rules out most paths before the comparison.
+  if (size < n || (size > n && path[n] != '/')) return false;
+  return n == 0 || std::memcmp(path, folderSlash.data(), n) == 0;
 }
 
 bool QueuePresent(const std::string& queuePath) {
@@ -77,40 +78,46 @@ bool IsPathInQueue(const std::string& path, const std::string& queuePath) {
   }
   const std::string folderSlash = full + "/";
 
+  internal::QueueLineReader reader;
+  if (!reader.Open(queuePath)) {
+    FIDX_LOG_AT(kPathInQueueOpenLine, "Failed to open queue=%s, reason=%m", queuePath.c_str());
+    return false;
+  }
   bool found = false;
   internal::QueueEventView view;
   internal::QueueEvent event;
-  const bool opened = internal::ForEachQueueLine(queuePath, [&](const char* data, size_t size) {
-    // Most lines are decided without building a document; the rest go to the full parser.
-    if (internal::ViewQueueLine(data, size, view)) {
-      if (LiesIn(view.path, view.pathSize, folderSlash) ||
-          (view.event == kRenameEvent && view.pathOld != nullptr &&
-           LiesIn(view.pathOld, view.pathOldSize, folderSlash))) {
-        found = true;
+  const char* data;
+  size_t size;
+  // Whole runs of lines: the fast reader finds where each line ends as it reads it.
+  while (reader.NextLines(data, size)) {
+    const char* const end = data + size;
+    for (const char* line = data; line < end;) {
+      const char* lineEnd = nullptr;
+      const internal::QueueLineKind kind = internal::ClassifyQueueLine(line, end, view, lineEnd);
+      if (kind == internal::QueueLineKind::kEvent) {
+        if (LiesIn(view.path, view.pathSize, folderSlash) ||
+            (view.event == kRenameEvent && view.pathOld != nullptr &&
+             LiesIn(view.pathOld, view.pathOldSize, folderSlash))) {
+          found = true;
+        }
+      } else {
+        lineEnd = static_cast<const char*>(std::memchr(line, '\n', static_cast<size_t>(end - line)));
+        if (lineEnd == nullptr) lineEnd = end;
+        const size_t lineSize = static_cast<size_t>(lineEnd - line);
+        // A line the fast reader could not decide goes to the full parser, which has the
+        // last word.
+        if (kind == internal::QueueLineKind::kNotEvent || !internal::ParseQueueLine(line, lineSize, event)) {
+          FIDX_LOG_AT(kPathInQueueMalformedLine, "Malformed command: %s",
+                      std::string(line, lineSize).c_str());
+        } else if (LiesIn(event.path.data(), event.path.size(), folderSlash) ||
+                   (event.event == kRenameEvent &&
+                    LiesIn(event.pathOld.data(), event.pathOld.size(), folderSlash))) {
+          // Another code's old path reads as empty, which lies in no folder.
+          found = true;
+        }
       }
-      return true;
+      line = lineEnd < end ? lineEnd + 1 : end;
     }
-    bool parsed;
-    try {
-      parsed = internal::ParseQueueLine(data, size, event);
-    } catch (const std::exception&) {
-      // The JSON library throws on nesting beyond its limit: that line is malformed too.
-      parsed = false;
-    }
-    if (!parsed) {
-      FIDX_LOG_AT(kPathInQueueMalformedLine, "Malformed command: %s", std::string(data, size).c_str());
-      return true;
-    }
-    // Another code's old path reads as empty, which lies in no folder.
-    if (LiesIn(event.path.data(), event.path.size(), folderSlash) ||
-        (event.event == kRenameEvent && LiesIn(event.pathOld.data(), event.pathOld.size(), folderSlash))) {
-      found = true;
-    }
-    return true;
-  });
-  if (!opened) {
-    FIDX_LOG_AT(kPathInQueueOpenLine, "Failed to open queue=%s, reason=%m", queuePath.c_str());
-    return false;
   }
   return found;
 }

@@ -4,6 +4,7 @@
 #include <fileindex/status_mgr.h>
 #include <fileindex/utils.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <tavo/platform.h>
 #include <unistd.h>
 
@@ -13,6 +14,7 @@
 
 #include "internal/json_io.h"
 #include "internal/log.h"
+#include "internal/queue_line_view.h"
 #include "internal/queue_scan.h"
 
 namespace TAVO {
@@ -31,28 +33,87 @@ std::string FromBuffer(const char* buffer, size_t size) { return std::string(buf
 // lock: the daemon may be appending meanwhile, and a torn last line just does not parse.
 bool QueueHasReindexEvent(const std::string& full, const std::string& queuePath) {
   if (!IsFileExist(queuePath)) return false;
-  bool found = false;
-  internal::QueueEvent event;
-  bool opened = internal::ForEachQueueLine(queuePath, [&](const char* data, size_t size) {
-    // Without a backslash the line's strings are their raw bytes, so a line that does not
-    // contain the path cannot carry it; skipping it spares the JSON parse of most lines.
-    if (std::memchr(data, '\\', size) == nullptr && memmem(data, size, full.data(), full.size()) == nullptr) {
-      return true;
-    }
-    if (internal::ParseQueueLine(data, size, event) && event.event == kReindexEvent && event.path == full) {
-      found = true;
-      return false;
-    }
-    return true;
-  });
-  if (!opened) {
+  internal::QueueLineReader reader;
+  if (!reader.Open(queuePath)) {
     FIDX_LOG("Failed to open queue=%s, reason=%m", queuePath.c_str());
     return false;
   }
-  return found;
+  // Without a backslash a line's strings are their raw bytes, so only a line that holds
+  // a backslash or the path in quotes can carry the event. Both are searched for in
+  // whole runs of lines, and only the lines they fall in are read.
+  const std::string quoted = "\"" + full + "\"";
+  internal::QueueEventView view;
+  internal::QueueEvent event;
+  auto isReindexOfFull = [&](const char* line, size_t lineSize) {
+    if (internal::ViewQueueLine(line, lineSize, view)) {
+      return view.event == kReindexEvent && view.pathSize == full.size() &&
+             std::memcmp(view.path, full.data(), full.size()) == 0;
+    }
+    return internal::ParseQueueLine(line, lineSize, event) && event.event == kReindexEvent &&
+           event.path == full;
+  };
+  const char* data;
+  size_t size;
+  while (reader.NextLines(data, size)) {
+    const char* p = data;
+    const char* const end = data + size;
+    const char* backslash = nullptr;
+    const char* named = nullptr;
+    while (p < end) {
+      if (backslash == nullptr || backslash < p) {
+        backslash = static_cast<const char*>(std::memchr(p, '\\', static_cast<size_t>(end - p)));
+        if (backslash == nullptr) backslash = end;
+      }
+      if (named == nullptr || named < p) {
+        named =
+            static_cast<const char*>(memmem(p, static_cast<size_t>(end - p), quoted.data(), quoted.size()));
+        if (named == nullptr) named = end;
+      }
+      const char* hit = backslash < named ? backslash : named;
+      if (hit == end) break;
+      const char* lineStart = static_cast<const char*>(memrchr(p, '\n', static_cast<size_t>(hit - p)));
+      lineStart = lineStart == nullptr ? p : lineStart + 1;
+      const char* lineEnd = static_cast<const char*>(std::memchr(hit, '\n', static_cast<size_t>(end - hit)));
+      if (lineEnd == nullptr) lineEnd = end;
+      if (isReindexOfFull(lineStart, static_cast<size_t>(lineEnd - lineStart))) return true;
+      p = lineEnd < end ? lineEnd + 1 : end;
+    }
+  }
+  return false;
 }
 
 void Sleep0To9Ms() { ::usleep(static_cast<useconds_t>((std::rand() % 10) * 1000)); }
+
+// Opens the queue for appending, creating it when absent. The queue and its directory
+// "@eaDir" lie inside the share, where share users can plant links, so neither is
+// followed: the directory is opened with O_NOFOLLOW and the file opened relative to it,
+// also with O_NOFOLLOW. O_NONBLOCK keeps a planted FIFO from hanging the caller (which
+// may hold folder.conf's lock), and anything but a regular file is refused. A real
+// "@eaDir" holding a regular queue (or none yet) opens exactly as a plain open() would.
+int OpenQueueForAppend(const std::string& queuePath) {
+  const std::string::size_type slash = queuePath.rfind('/');
+  if (slash == std::string::npos) {
+    errno = EINVAL;
+    return -1;
+  }
+  const std::string dir = slash == 0 ? std::string("/") : queuePath.substr(0, slash);
+  int dirFd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (dirFd < 0) return -1;
+  int fd = ::openat(dirFd, queuePath.c_str() + slash + 1,
+                    O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0644);
+  int openErrno = errno;
+  ::close(dirFd);
+  if (fd >= 0) {
+    struct stat st;
+    if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+      ::close(fd);
+      fd = -1;
+      openErrno = EINVAL;
+    }
+  }
+  errno = openErrno;
+  return fd;
+}
 
 enum class AppendResult { kWritten, kBusy, kFailed };
 
@@ -61,7 +122,7 @@ enum class AppendResult { kWritten, kBusy, kFailed };
 AppendResult AppendLocked(const std::string& queuePath, const std::string& line) {
   int lockErrno = 0;
   for (int attempt = 0; attempt < kQueueLockTries; ++attempt) {
-    int fd = ::open(queuePath.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW, 0644);
+    int fd = OpenQueueForAppend(queuePath);
     if (fd < 0) return AppendResult::kFailed;
     if (::flock(fd, LOCK_EX | LOCK_NB) == 0) {
       ssize_t written = ::write(fd, line.data(), line.size());

@@ -3,6 +3,11 @@
 #include <climits>
 #include <cstdint>
 #include <cstring>
+#include <initializer_list>
+
+#ifdef __SSE2__
+#include <emmintrin.h>
+#endif
 
 namespace TAVO {
 namespace FILEINDEX {
@@ -12,265 +17,461 @@ namespace {
 
 // Well below the JSON library's own nesting limit, which it enforces by throwing.
 const int kMaxDepth = 64;
+// The JSON library throws on member names of 2^30 bytes and more; no shorter line holds one.
+const size_t kMaxLine = size_t(1) << 30;
+// Integers of up to 18 digits fit the JSON library's 64-bit integers; longer ones go
+// through its floating-point conversion, which depends on the stream's locale.
+const int kMaxDigits = 18;
 
-// The bytes that end an ordinary run inside a string: the quote, the backslash and the
-// control characters.
-struct SpecialInString {
-  bool table[256];
-  constexpr SpecialInString() : table() {
-    for (int c = 0; c < 0x20; ++c) table[c] = true;
-    table[static_cast<unsigned char>('"')] = true;
-    table[static_cast<unsigned char>('\\')] = true;
+#define FIDX_HOT inline __attribute__((always_inline))
+
+// A line holds no newline, so the blanks between tokens are these three.
+inline bool IsSpace(char c) { return c == ' ' || c == '\t' || c == '\r'; }
+inline bool IsDigit(char c) { return c >= '0' && c <= '9'; }
+
+int HexDigit(char c) {
+  if (c >= '0' && c <= '9') return c - '0';
+  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+  return -1;
+}
+
+// Four hex digits at p (which has at least four bytes).
+bool Hex4(const char* p, unsigned& out) {
+  out = 0;
+  for (int i = 0; i < 4; ++i) {
+    const int digit = HexDigit(p[i]);
+    if (digit < 0) return false;
+    out = out * 16 + static_cast<unsigned>(digit);
   }
-  bool operator[](unsigned char c) const { return table[c]; }
-};
-constexpr SpecialInString kSpecialInString;
+  return true;
+}
 
-// Accepts only a strict subset of JSON whose every line the JSON library also accepts
-// with the same values: RFC grammar, integer numbers only, escapes only outside the
-// members that are read. Every method answers false for "not certain".
+bool IsHighSurrogate(unsigned code) { return code >= 0xD800 && code <= 0xDBFF; }
+
+// The first quote, backslash or newline in [p, end), or end; the bytes from lineBegin on
+// may be read. Inside a string the quote and the backslash are the only bytes with a
+// meaning (the JSON library keeps raw control characters and any other byte as they
+// are), and a newline ends the line before the string.
+FIDX_HOT const char* FindStringStop(const char* p, const char* end, const char* lineBegin) {
+#ifdef __SSE2__
+  const __m128i quote = _mm_set1_epi8('"');
+  const __m128i backslash = _mm_set1_epi8('\\');
+  const __m128i newline = _mm_set1_epi8('\n');
+  auto stops = [&](const char* at) {
+    const __m128i bytes = _mm_loadu_si128(reinterpret_cast<const __m128i*>(at));
+    return static_cast<unsigned>(_mm_movemask_epi8(
+        _mm_or_si128(_mm_or_si128(_mm_cmpeq_epi8(bytes, quote), _mm_cmpeq_epi8(bytes, backslash)),
+                     _mm_cmpeq_epi8(bytes, newline))));
+  };
+  while (end - p >= 16) {
+    const unsigned mask = stops(p);
+    if (mask != 0) return p + __builtin_ctz(mask);
+    p += 16;
+  }
+  if (p < end && end - lineBegin >= 16) {
+    // The last 16 bytes, overlapping what was searched already.
+    const char* window = end - 16;
+    const unsigned mask = stops(window) >> (p - window);
+    return mask != 0 ? p + __builtin_ctz(mask) : end;
+  }
+#else
+  static_cast<void>(lineBegin);
+#endif
+  while (p < end && *p != '"' && *p != '\\' && *p != '\n') ++p;
+  return p;
+}
+
+void AppendUtf8(std::string& out, unsigned code) {
+  if (code <= 0x7F) {
+    out += static_cast<char>(code);
+  } else if (code <= 0x7FF) {
+    out += static_cast<char>(0xC0 | (code >> 6));
+    out += static_cast<char>(0x80 | (code & 0x3F));
+  } else if (code <= 0xFFFF) {
+    out += static_cast<char>(0xE0 | (code >> 12));
+    out += static_cast<char>(0x80 | ((code >> 6) & 0x3F));
+    out += static_cast<char>(0x80 | (code & 0x3F));
+  } else {
+    out += static_cast<char>(0xF0 | (code >> 18));
+    out += static_cast<char>(0x80 | ((code >> 12) & 0x3F));
+    out += static_cast<char>(0x80 | ((code >> 6) & 0x3F));
+    out += static_cast<char>(0x80 | (code & 0x3F));
+  }
+}
+
+// The value of a string's text whose escapes Reader::String has checked, decoded the
+// way the JSON library decodes it. A high surrogate takes the next \u escape as its
+// partner whatever that escape's value (the library checks only its form), and a lone
+// low surrogate is encoded as it stands.
+void Decode(const char* p, const char* end, std::string& out) {
+  out.clear();
+  for (;;) {
+    const char* backslash = static_cast<const char*>(std::memchr(p, '\\', static_cast<size_t>(end - p)));
+    if (backslash == nullptr) {
+      out.append(p, end);
+      return;
+    }
+    out.append(p, backslash);
+    p = backslash + 2;
+    switch (backslash[1]) {
+      case 'b':
+        out += '\b';
+        break;
+      case 'f':
+        out += '\f';
+        break;
+      case 'n':
+        out += '\n';
+        break;
+      case 'r':
+        out += '\r';
+        break;
+      case 't':
+        out += '\t';
+        break;
+      case 'u': {
+        unsigned code;
+        Hex4(p, code);
+        p += 4;
+        if (IsHighSurrogate(code)) {
+          unsigned low;
+          Hex4(p + 2, low);
+          p += 6;
+          code = 0x10000 + ((code & 0x3FF) << 10) + (low & 0x3FF);
+        }
+        AppendUtf8(out, code);
+        break;
+      }
+      default:  // '"', '\\' and '/' stand for themselves
+        out += backslash[1];
+        break;
+    }
+  }
+}
+
+// Reads only a strict subset of JSON whose every line the JSON library reads the same
+// way: RFC grammar, integers of at most 18 digits, plain member names. Every step takes
+// the position and returns the one after what it read (the position stays in a
+// register), or null when it gives up; giving up because the line ended is remembered,
+// since the JSON library refuses a text that ends before its value does.
 class Reader {
  public:
-  Reader(const char* p, const char* end) : p_(p), end_(end) {}
+  // The line starts at begin and ends at the first newline before limit, or at limit.
+  Reader(const char* begin, const char* limit) : begin_(begin), end_(limit) {}
 
-  bool Line(QueueEventView& out) {
-    SkipSpaces();
-    if (!Peek('{')) return false;
-    ++p_;
-    SkipSpaces();
-    bool haveEvent = false;
-    bool havePath = false;
-    QueueEventView view;
-    // An empty object has no event: the caller's parser logs it.
-    while (Peek('"')) {
-      const char* key;
-      size_t keySize;
-      bool plain;
-      if (!String(key, keySize, plain) || !plain) return false;
-      SkipSpaces();
-      if (!Peek(':')) return false;
-      ++p_;
-      SkipSpaces();
-      // A repeated member replaces the earlier one, as the JSON library does.
-      if (Is(key, keySize, "event")) {
-        if (!Unsigned(view.event)) return false;
-        haveEvent = true;
-      } else if (Is(key, keySize, "path")) {
-        if (!Peek('"') || !String(view.path, view.pathSize, plain) || !plain) return false;
-        havePath = true;
-      } else if (Is(key, keySize, "path_old")) {
-        if (Peek('"')) {
-          if (!String(view.pathOld, view.pathOldSize, plain) || !plain) return false;
-        } else {
-          if (!Value(1)) return false;
-          view.pathOld = nullptr;
-          view.pathOldSize = 0;
-        }
-      } else if (!Value(1)) {
-        return false;
-      }
-      SkipSpaces();
-      if (Peek(',')) {
-        ++p_;
-        SkipSpaces();
-        if (!Peek('"')) return false;
-        continue;
-      }
-      if (!Peek('}')) return false;
-      ++p_;
-      SkipSpaces();
-      if (p_ != end_ || !haveEvent || !havePath) return false;
-      out = view;
-      return true;
+  QueueLineKind Line(QueueEventView& out, const char*& lineEnd) const {
+    bool event = false;
+    const char* p = Root(begin_, out, event);
+    if (p == nullptr) return ended_ ? QueueLineKind::kNotEvent : QueueLineKind::kUndecided;
+    p = SkipSpaces(p);
+    if (!AtEnd(p)) {
+      // The JSON library takes a NUL byte for the end of the text; anything else after
+      // the value is refused.
+      return *p == '\0' ? QueueLineKind::kUndecided : QueueLineKind::kNotEvent;
     }
-    return false;
+    if (!event) return QueueLineKind::kNotEvent;
+    if (static_cast<size_t>(p - begin_) >= kMaxLine) return QueueLineKind::kUndecided;
+    lineEnd = p;
+    return QueueLineKind::kEvent;
   }
 
  private:
-  bool Peek(char c) const { return p_ < end_ && *p_ == c; }
-
-  void SkipSpaces() {
-    while (p_ < end_ && (*p_ == ' ' || *p_ == '\t' || *p_ == '\r' || *p_ == '\n')) ++p_;
-  }
-
-  static bool Is(const char* key, size_t size, const char* name) {
-    return size == std::strlen(name) && std::memcmp(key, name, size) == 0;
-  }
-
-  // Skips whole 8-byte words that hold no special byte, tested all at once: a byte is
-  // zero after XOR with '"' or '\\', or below 0x20 (the word tricks are exact about
-  // whether such a byte exists). The byte loop then finds where it is.
-  void SkipOrdinaryWords() {
-    const uint64_t ones = 0x0101010101010101ULL;
-    const uint64_t highs = 0x8080808080808080ULL;
-    while (end_ - p_ >= 8) {
-      uint64_t word;
-      std::memcpy(&word, p_, sizeof(word));
-      const uint64_t quote = word ^ (ones * '"');
-      const uint64_t backslash = word ^ (ones * '\\');
-      const uint64_t special =
-          ((quote - ones) & ~quote) | ((backslash - ones) & ~backslash) | ((word - ones * 0x20) & ~word);
-      if ((special & highs) != 0) return;
-      p_ += 8;
-    }
-  }
-
-  static int Hex(char c) {
-    if (c >= '0' && c <= '9') return c - '0';
-    if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-    if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-    return -1;
-  }
-
-  // At the opening quote. The span excludes the quotes; plain is false when the
-  // string holds an escape, so that its bytes are not its value.
-  bool String(const char*& begin, size_t& size, bool& plain) {
-    ++p_;
-    begin = p_;
-    plain = true;
+  // The whole value; event tells whether it is an object with an "event" convertible to
+  // an unsigned integer and a string "path".
+  const char* Root(const char* p, QueueEventView& out, bool& event) const {
+    p = SkipSpaces(p);
+    if (!At(p, '{')) return AtEnd(p) ? Stop(p) : Value(p, 1);
+    p = SkipSpaces(p + 1);
+    if (At(p, '}')) return p + 1;
+    if (!At(p, '"')) return Stop(p);
+    bool haveEvent = false;
+    bool havePath = false;
+    out.pathOld = nullptr;
+    out.pathOldSize = 0;
     for (;;) {
-      // Ordinary bytes are skipped in bulk; only a quote, a backslash or a control
-      // character stops the scan.
-      SkipOrdinaryWords();
-      while (p_ < end_ && !kSpecialInString[static_cast<unsigned char>(*p_)]) ++p_;
-      if (p_ == end_) return false;
-      const char c = *p_;
-      if (c == '"') {
-        size = static_cast<size_t>(p_ - begin);
-        ++p_;
-        return true;
-      }
-      // Raw control characters are tolerated by the JSON library but not by JSON.
-      if (c != '\\') return false;
-      plain = false;
-      if (++p_ == end_) return false;
-      if (*p_ == 'u') {
-        if (end_ - p_ < 5) return false;
-        int code = 0;
-        for (int i = 1; i <= 4; ++i) {
-          int digit = Hex(p_[i]);
-          if (digit < 0) return false;
-          code = code * 16 + digit;
+      const char* key;
+      const char* keyEnd;
+      bool escaped;
+      p = String(p, key, keyEnd, escaped);
+      if (p == nullptr || escaped) return nullptr;
+      p = SkipSpaces(p);
+      if (!At(p, ':')) return Stop(p);
+      p = SkipSpaces(p + 1);
+      // A repeated member replaces the earlier one, as the JSON library does.
+      const size_t keySize = static_cast<size_t>(keyEnd - key);
+      if (keySize == 5 && std::memcmp(key, "event", 5) == 0) {
+        p = Event(p, out.event, haveEvent);
+      } else if (keySize == 4 && std::memcmp(key, "path", 4) == 0) {
+        // A path that is not a string may still be followed by one that is.
+        havePath = At(p, '"');
+        p = havePath ? Member(p, out.path, out.pathSize, out.pathStorage) : Value(p, 1);
+      } else if (keySize == 8 && std::memcmp(key, "path_old", 8) == 0) {
+        if (At(p, '"')) {
+          p = Member(p, out.pathOld, out.pathOldSize, out.pathOldStorage);
+        } else {
+          p = Value(p, 1);
+          out.pathOld = nullptr;
+          out.pathOldSize = 0;
         }
-        // Surrogate pairs have rules of their own in the JSON library.
-        if (code >= 0xD800 && code <= 0xDFFF) return false;
-        p_ += 4;
-      } else if (*p_ == '\0' || std::strchr("\"\\/bfnrt", *p_) == nullptr) {
-        return false;
+      } else {
+        p = Value(p, 1);
       }
-      ++p_;
-    }
-  }
-
-  // -?(0|[1-9][0-9]*). Fractions and exponents go to the JSON library, whose reading
-  // of them depends on the stream's conversion.
-  bool Integer(bool& negative, unsigned long long& value, int& digits) {
-    negative = Peek('-');
-    if (negative) ++p_;
-    if (p_ == end_ || *p_ < '0' || *p_ > '9') return false;
-    value = 0;
-    digits = 0;
-    if (*p_ == '0') {
-      ++p_;
-      digits = 1;
-    } else {
-      while (p_ < end_ && *p_ >= '0' && *p_ <= '9') {
-        if (digits < 19) value = value * 10 + static_cast<unsigned>(*p_ - '0');
-        ++digits;
-        ++p_;
-      }
-    }
-    return p_ == end_ || (*p_ != '.' && *p_ != 'e' && *p_ != 'E' && (*p_ < '0' || *p_ > '9'));
-  }
-
-  // Only a plain integer in range is decided here; null, booleans, fractions and
-  // negative or larger numbers are left to the JSON library's conversion rules.
-  bool Unsigned(unsigned& out) {
-    if (p_ == end_ || *p_ < '0' || *p_ > '9') return false;
-    bool negative;
-    unsigned long long value;
-    int digits;
-    if (!Integer(negative, value, digits) || digits > 10 || value > UINT_MAX) return false;
-    out = static_cast<unsigned>(value);
-    return true;
-  }
-
-  bool Literal(const char* word) {
-    size_t n = std::strlen(word);
-    if (static_cast<size_t>(end_ - p_) < n || std::memcmp(p_, word, n) != 0) return false;
-    p_ += n;
-    return true;
-  }
-
-  bool Value(int depth) {
-    if (p_ == end_) return false;
-    switch (*p_) {
-      case '{':
-        return Container(depth, '}', true);
-      case '[':
-        return Container(depth, ']', false);
-      case '"': {
-        const char* begin;
-        size_t size;
-        bool plain;
-        return String(begin, size, plain);
-      }
-      case 't':
-        return Literal("true");
-      case 'f':
-        return Literal("false");
-      case 'n':
-        return Literal("null");
-      default: {
-        bool negative;
-        unsigned long long value;
-        int digits;
-        return Integer(negative, value, digits);
-      }
-    }
-  }
-
-  bool Container(int depth, char close, bool object) {
-    if (depth >= kMaxDepth) return false;
-    ++p_;
-    SkipSpaces();
-    if (Peek(close)) {
-      ++p_;
-      return true;
-    }
-    for (;;) {
-      if (object) {
-        const char* key;
-        size_t keySize;
-        bool plain;
-        if (!Peek('"') || !String(key, keySize, plain)) return false;
-        SkipSpaces();
-        if (!Peek(':')) return false;
-        ++p_;
-        SkipSpaces();
-      }
-      if (!Value(depth + 1)) return false;
-      SkipSpaces();
-      if (Peek(',')) {
-        ++p_;
-        SkipSpaces();
+      if (p == nullptr) return nullptr;
+      p = SkipSpaces(p);
+      if (At(p, ',')) {
+        p = SkipSpaces(p + 1);
+        if (!At(p, '"')) return Stop(p);
         continue;
       }
-      if (!Peek(close)) return false;
-      ++p_;
-      return true;
+      if (!At(p, '}')) return Stop(p);
+      event = haveEvent && havePath;
+      return p + 1;
     }
   }
 
-  const char* p_;
-  const char* end_;
+  FIDX_HOT bool AtEnd(const char* p) const { return p == end_ || *p == '\n'; }
+  FIDX_HOT bool At(const char* p, char c) const { return p < end_ && *p == c; }
+
+  // Gives up at p, remembering whether the line ended there.
+  const char* Stop(const char* p) const {
+    ended_ = AtEnd(p);
+    return nullptr;
+  }
+
+  FIDX_HOT const char* SkipSpaces(const char* p) const {
+    // Compact lines have no blanks: one comparison rules them out.
+    while (p < end_ && static_cast<unsigned char>(*p) <= ' ' && IsSpace(*p)) ++p;
+    return p;
+  }
+
+  // n hex digits at p, or a stop at the first byte that is not one.
+  const char* HexDigits(const char* p, int n, unsigned& out) const {
+    out = 0;
+    for (int i = 0; i < n; ++i, ++p) {
+      if (AtEnd(p)) return Stop(p);
+      const int digit = HexDigit(*p);
+      if (digit < 0) return Stop(p);
+      out = out * 16 + static_cast<unsigned>(digit);
+    }
+    return p;
+  }
+
+  // At a backslash inside a string: one escape the JSON library decodes.
+  const char* Escape(const char* p) const {
+    ++p;
+    if (AtEnd(p)) return Stop(p);
+    switch (*p) {
+      case '"':
+      case '\\':
+      case '/':
+      case 'b':
+      case 'f':
+      case 'n':
+      case 'r':
+      case 't':
+        return p + 1;
+      case 'u': {
+        unsigned code;
+        p = HexDigits(p + 1, 4, code);
+        if (p == nullptr || !IsHighSurrogate(code)) return p;
+        for (char c : {'\\', 'u'}) {
+          if (!At(p, c)) return Stop(p);
+          ++p;
+        }
+        return HexDigits(p, 4, code);
+      }
+      default:
+        return Stop(p);
+    }
+  }
+
+  // At the opening quote. [begin, end) is the text between the quotes; escaped tells
+  // whether it holds escapes, so that it is not the value itself.
+  FIDX_HOT const char* String(const char* p, const char*& begin, const char*& end, bool& escaped) const {
+    begin = ++p;
+    escaped = false;
+    for (;;) {
+      p = FindStringStop(p, end_, begin_);
+      if (AtEnd(p)) return Stop(p);
+      if (*p == '"') {
+        end = p;
+        return p + 1;
+      }
+      escaped = true;
+      p = Escape(p);
+      if (p == nullptr) return nullptr;
+    }
+  }
+
+  // A string member that is read: its value, decoded into storage when it has escapes.
+  FIDX_HOT const char* Member(const char* p, const char*& value, size_t& size, std::string& storage) const {
+    const char* begin;
+    const char* end;
+    bool escaped;
+    p = String(p, begin, end, escaped);
+    if (p == nullptr) return nullptr;
+    if (escaped) {
+      Decode(begin, end, storage);
+      value = storage.data();
+      size = storage.size();
+    } else {
+      value = begin;
+      size = static_cast<size_t>(end - begin);
+    }
+    return p;
+  }
+
+  // How many digits start at p (at most kMaxDigits + 1 are counted).
+  FIDX_HOT size_t DigitRun(const char* p) const {
+#ifdef __SSE2__
+    if (end_ - p >= 16) {
+      const __m128i bytes = _mm_loadu_si128(reinterpret_cast<const __m128i*>(p));
+      const unsigned other = static_cast<unsigned>(_mm_movemask_epi8(_mm_or_si128(
+          _mm_cmplt_epi8(bytes, _mm_set1_epi8('0')), _mm_cmpgt_epi8(bytes, _mm_set1_epi8('9')))));
+      if (other != 0) return static_cast<size_t>(__builtin_ctz(other));
+    }
+#endif
+    size_t n = 0;
+    while (p + n < end_ && IsDigit(p[n]) && n <= static_cast<size_t>(kMaxDigits)) ++n;
+    return n;
+  }
+
+  // Digits with no leading zero, at most kMaxDigits of them, not followed by a fraction
+  // or an exponent; their value when asked for.
+  FIDX_HOT const char* Digits(const char* p, uint64_t* value) const {
+    const size_t n = DigitRun(p);
+    if (n == 0) return Stop(p);
+    if (n > static_cast<size_t>(kMaxDigits) || (n > 1 && *p == '0')) return nullptr;
+    if (value != nullptr) {
+      *value = 0;
+      for (size_t i = 0; i < n; ++i) *value = *value * 10 + static_cast<unsigned>(p[i] - '0');
+    }
+    p += n;
+    if (p < end_ && (*p == '.' || *p == 'e' || *p == 'E')) return nullptr;
+    return p;
+  }
+
+  FIDX_HOT const char* Literal(const char* p, const char* word, size_t size) const {
+    for (size_t i = 0; i < size; ++i) {
+      if (AtEnd(p + i) || p[i] != word[i]) return Stop(p + i);
+    }
+    return p + size;
+  }
+
+  // An "event" value: convertible is set when it converts to an unsigned integer (an
+  // integer in range, null as 0, a boolean) with out its value, cleared when it certainly
+  // does not (a string, an array, an object, an integer out of range other than -0).
+  // Fractions and exponents are left to the JSON library's own conversion.
+  const char* Event(const char* p, unsigned& out, bool& convertible) const {
+    if (AtEnd(p)) return Stop(p);
+    switch (*p) {
+      case 'n':
+        out = 0;
+        convertible = true;
+        return Literal(p, "null", 4);
+      case 't':
+        out = 1;
+        convertible = true;
+        return Literal(p, "true", 4);
+      case 'f':
+        out = 0;
+        convertible = true;
+        return Literal(p, "false", 5);
+      case '"':
+      case '[':
+      case '{':
+        convertible = false;
+        return Value(p, 1);
+      case '-': {
+        uint64_t value;
+        p = Digits(p + 1, &value);
+        if (p == nullptr || value == 0) return nullptr;
+        convertible = false;
+        return p;
+      }
+      default: {
+        uint64_t value;
+        p = Digits(p, &value);
+        if (p == nullptr) return nullptr;
+        convertible = value <= UINT_MAX;
+        out = static_cast<unsigned>(value);
+        return p;
+      }
+    }
+  }
+
+  const char* Value(const char* p, int depth) const {
+    if (AtEnd(p)) return Stop(p);
+    switch (*p) {
+      case '"': {
+        const char* begin;
+        const char* end;
+        bool escaped;
+        return String(p, begin, end, escaped);
+      }
+      case '{':
+        return Container(p, depth, '}', true);
+      case '[':
+        return Container(p, depth, ']', false);
+      case 't':
+        return Literal(p, "true", 4);
+      case 'f':
+        return Literal(p, "false", 5);
+      case 'n':
+        return Literal(p, "null", 4);
+      case '-':
+        return Digits(p + 1, nullptr);
+      default:
+        return Digits(p, nullptr);
+    }
+  }
+
+  const char* Container(const char* p, int depth, char close, bool object) const {
+    if (depth >= kMaxDepth) return nullptr;
+    p = SkipSpaces(p + 1);
+    if (At(p, close)) return p + 1;
+    for (;;) {
+      if (object) {
+        const char* begin;
+        const char* end;
+        bool escaped;
+        if (!At(p, '"')) return Stop(p);
+        p = String(p, begin, end, escaped);
+        if (p == nullptr) return nullptr;
+        p = SkipSpaces(p);
+        if (!At(p, ':')) return Stop(p);
+        p = SkipSpaces(p + 1);
+      }
+      p = Value(p, depth + 1);
+      if (p == nullptr) return nullptr;
+      p = SkipSpaces(p);
+      if (At(p, ',')) {
+        p = SkipSpaces(p + 1);
+        continue;
+      }
+      return At(p, close) ? p + 1 : Stop(p);
+    }
+  }
+
+  const char* const begin_;
+  const char* const end_;
+  mutable bool ended_ = false;
 };
+
+#undef FIDX_HOT
 
 }  // namespace
 
+QueueLineKind ClassifyQueueLine(const char* data, const char* limit, QueueEventView& out,
+                                const char*& lineEnd) {
+  return Reader(data, limit).Line(out, lineEnd);
+}
+
 bool ViewQueueLine(const char* data, size_t size, QueueEventView& out) {
-  Reader reader(data, data + size);
-  return reader.Line(out);
+  const char* lineEnd;
+  return ClassifyQueueLine(data, data + size, out, lineEnd) == QueueLineKind::kEvent &&
+         lineEnd == data + size;
 }
 
 }  // namespace internal

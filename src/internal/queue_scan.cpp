@@ -4,9 +4,7 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstring>
 #include <exception>
-#include <memory>
 
 #include "internal/json_io.h"
 
@@ -15,55 +13,117 @@ namespace FILEINDEX {
 namespace internal {
 
 namespace {
-const size_t kBlockSize = 1 << 20;
+// Large enough that system calls are rare, small enough to stay in the core's cache
+// while its lines are read.
+const size_t kBlockSize = 256 << 10;
 
-class Fd {
- public:
-  explicit Fd(int fd) : fd_(fd) {}
-  ~Fd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
+// The member of an object, without inserting one.
+const Json::Value* Find(const Json::Value& object, const char* name) {
+  return object.find(name, name + std::strlen(name));
+}
 }  // namespace
 
-bool ForEachQueueLine(const std::string& path, const QueueLineVisitor& visit) {
-  Fd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (fd.get() < 0) return false;
+QueueLineReader::QueueLineReader() : fd_(-1), eof_(false), capacity_(0), pos_(nullptr), filled_(nullptr) {}
 
-  std::unique_ptr<char[]> block(new char[kBlockSize]);
-  // The start of a line that continues beyond the block read so far.
-  std::string carry;
-  for (;;) {
-    ssize_t n = ::read(fd.get(), block.get(), kBlockSize);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) break;
-    const char* p = block.get();
-    const char* end = p + n;
-    while (p < end) {
-      const char* nl = static_cast<const char*>(std::memchr(p, '\n', static_cast<size_t>(end - p)));
-      if (nl == nullptr) {
-        carry.append(p, static_cast<size_t>(end - p));
-        break;
-      }
-      bool more;
-      if (carry.empty()) {
-        more = visit(p, static_cast<size_t>(nl - p));
-      } else {
-        carry.append(p, static_cast<size_t>(nl - p));
-        more = visit(carry.data(), carry.size());
-        carry.clear();
-      }
-      if (!more) return true;
-      p = nl + 1;
-    }
+QueueLineReader::~QueueLineReader() {
+  if (fd_ >= 0) ::close(fd_);
+}
+
+bool QueueLineReader::Open(const std::string& path) {
+  if (fd_ >= 0) ::close(fd_);
+  // O_NONBLOCK: a FIFO put in the queue's place must not hang the reader; it changes
+  // nothing for a regular file.
+  fd_ = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
+  if (fd_ < 0) return false;
+  // The whole file is read once, front to back.
+  ::posix_fadvise(fd_, 0, 0, POSIX_FADV_SEQUENTIAL);
+  if (!block_) {
+    capacity_ = kBlockSize;
+    block_.reset(new char[capacity_]);
   }
-  if (!carry.empty()) visit(carry.data(), carry.size());
+  pos_ = filled_ = block_.get();
+  eof_ = false;
+  return true;
+}
+
+bool QueueLineReader::Refill() {
+  if (eof_) return false;
+  const size_t kept = static_cast<size_t>(filled_ - pos_);
+  if (kept == capacity_) {
+    // One line fills the whole block: make room for the rest of it.
+    std::unique_ptr<char[]> bigger(new char[capacity_ * 2]);
+    std::memcpy(bigger.get(), pos_, kept);
+    block_.swap(bigger);
+    capacity_ *= 2;
+  } else if (kept > 0 && pos_ != block_.get()) {
+    std::memmove(block_.get(), pos_, kept);
+  }
+  pos_ = block_.get();
+  filled_ = pos_ + kept;
+  for (;;) {
+    const ssize_t n = ::read(fd_, block_.get() + kept, capacity_ - kept);
+    if (n > 0) {
+      filled_ += n;
+      return true;
+    }
+    if (n < 0 && errno == EINTR) continue;
+    eof_ = true;
+    return false;
+  }
+}
+
+bool QueueLineReader::NextLineSlow(const char*& data, size_t& size) {
+  if (fd_ < 0) return false;
+  // Searched already: the unread bytes hold no newline.
+  size_t searched = static_cast<size_t>(filled_ - pos_);
+  while (Refill()) {
+    const char* from = pos_ + searched;
+    const char* nl = static_cast<const char*>(std::memchr(from, '\n', static_cast<size_t>(filled_ - from)));
+    if (nl != nullptr) {
+      data = pos_;
+      size = static_cast<size_t>(nl - pos_);
+      pos_ = nl + 1;
+      return true;
+    }
+    searched = static_cast<size_t>(filled_ - pos_);
+  }
+  if (pos_ == filled_) return false;
+  data = pos_;
+  size = static_cast<size_t>(filled_ - pos_);
+  pos_ = filled_;
+  return true;
+}
+
+bool QueueLineReader::NextLines(const char*& data, size_t& size) {
+  if (fd_ < 0) return false;
+  size_t searched = 0;
+  for (;;) {
+    const char* from = pos_ + searched;
+    const void* last = ::memrchr(from, '\n', static_cast<size_t>(filled_ - from));
+    if (last != nullptr) {
+      data = pos_;
+      size = static_cast<size_t>(static_cast<const char*>(last) + 1 - pos_);
+      pos_ += size;
+      return true;
+    }
+    searched = static_cast<size_t>(filled_ - pos_);
+    if (!Refill()) break;
+  }
+  if (pos_ == filled_) return false;
+  data = pos_;
+  size = static_cast<size_t>(filled_ - pos_);
+  pos_ = filled_;
+  return true;
+}
+
+bool ForEachQueueLine(const std::string& path, const QueueLineVisitor& visit) {
+  QueueLineReader reader;
+  if (!reader.Open(path)) return false;
+  const char* data;
+  size_t size;
+  while (reader.NextLine(data, size)) {
+    if (!visit(data, size)) break;
+  }
   return true;
 }
 
@@ -77,13 +137,13 @@ bool ParseQueueLine(const char* data, size_t size, QueueEvent& out) {
     return false;
   }
   if (!line.isObject()) return false;
-  const Json::Value* event = line.find("event", "event" + 5);
-  const Json::Value* path = line.find("path", "path" + 4);
+  const Json::Value* event = Find(line, "event");
+  const Json::Value* path = Find(line, "path");
   if (event == nullptr || path == nullptr) return false;
   if (!event->isConvertibleTo(Json::uintValue) || !path->isString()) return false;
   out.event = event->asUInt();
   out.path = path->asString();
-  const Json::Value* pathOld = line.find("path_old", "path_old" + 8);
+  const Json::Value* pathOld = Find(line, "path_old");
   out.hasPathOld = pathOld != nullptr && pathOld->isString();
   if (out.hasPathOld) {
     out.pathOld = pathOld->asString();

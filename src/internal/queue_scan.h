@@ -4,7 +4,9 @@
 #define FILEINDEX_INTERNAL_QUEUE_SCAN_H
 
 #include <cstddef>
+#include <cstring>
 #include <functional>
+#include <memory>
 #include <string>
 
 namespace TAVO {
@@ -19,13 +21,56 @@ struct QueueEvent {
   bool hasPathOld = false;
 };
 
+// Reads a file a block at a time and hands out its lines: each ends at a "\n", which is
+// not part of it (a "\r" stays), and a last line without a newline counts too. Memory
+// is one block, grown only for a line longer than a block. A read error ends the file.
+class QueueLineReader {
+ public:
+  QueueLineReader();
+  ~QueueLineReader();
+  QueueLineReader(const QueueLineReader&) = delete;
+  QueueLineReader& operator=(const QueueLineReader&) = delete;
+
+  // False when the file cannot be opened, with errno left as open() set it.
+  bool Open(const std::string& path);
+
+  // The next line; the bytes stay valid until the next call. False at the end.
+  bool NextLine(const char*& data, size_t& size) {
+    if (pos_ < filled_) {
+      const char* nl = static_cast<const char*>(std::memchr(pos_, '\n', static_cast<size_t>(filled_ - pos_)));
+      if (nl != nullptr) {
+        data = pos_;
+        size = static_cast<size_t>(nl - pos_);
+        pos_ = nl + 1;
+        return true;
+      }
+    }
+    return NextLineSlow(data, size);
+  }
+
+  // The next run of whole lines, each with its "\n" (the file's last line may lack
+  // one); for callers that search many lines at once. False at the end.
+  bool NextLines(const char*& data, size_t& size);
+
+ private:
+  bool NextLineSlow(const char*& data, size_t& size);
+  // Keeps the unread bytes and reads more after them; false when nothing was added.
+  bool Refill();
+
+  int fd_;
+  bool eof_;
+  size_t capacity_;
+  std::unique_ptr<char[]> block_;
+  // The unread bytes of the block.
+  const char* pos_;
+  const char* filled_;
+};
+
 // Called once per line, without its "\n" (a "\r" stays in the line). The data is valid
 // only during the call. Returning false ends the scan early.
 using QueueLineVisitor = std::function<bool(const char* data, size_t size)>;
 
-// Reads the file in fixed-size blocks and hands every line to visit, the last one also
-// when it has no newline; memory use is bounded by the block and the longest line. A
-// read error ends the scan like the end of the file. False only when the file cannot be
+// Every line of the file through QueueLineReader. False only when the file cannot be
 // opened, with errno left as open() set it.
 bool ForEachQueueLine(const std::string& path, const QueueLineVisitor& visit);
 
