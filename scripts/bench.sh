@@ -6,6 +6,7 @@
 # not comparable.
 set -euo pipefail
 cd "$(dirname "$0")/.."
+bash scripts/install-deps.sh
 BUILD_DIR=${BUILD_DIR:-build-bench}
 RSS_MEGABYTES=${RSS_MEGABYTES:-1024}
 
