@@ -3,7 +3,8 @@
 # what is already installed.
 set -euo pipefail
 packages=(cmake make g++ pkg-config libjsoncpp-dev libicu-dev libgtest-dev libgmock-dev
-          libbenchmark-dev libcli11-dev python3 abigail-tools)
+          libbenchmark-dev libcli11-dev python3 abigail-tools
+          clang-14 libclang-rt-14-dev)
 missing=()
 for p in "${packages[@]}"; do
   dpkg -s "$p" >/dev/null 2>&1 || missing+=("$p")

@@ -5,6 +5,7 @@
 #include <fileindex/index_mgr.h>
 #include <fileindex/status_mgr.h>
 #include <fileindex/utils.h>
+#include <sys/stat.h>
 #include <tavo/platform.h>
 
 #include <set>
@@ -163,20 +164,36 @@ bool IndexMgr::Update(const std::string& path, const Json::Value& setting) {
 }
 
 bool IndexMgr::CleanShareIndexData(const std::string& share) {
+  // rm -rf removes a link found at the path itself, never what it points to, but it
+  // follows links in the directories above. The index data lies in the share's "@eaDir",
+  // which share users could replace by a link to a directory elsewhere, and rm runs as
+  // root: a removal through such a link is skipped, with a log line. A real "@eaDir" (or
+  // none at all) is removed from exactly as before. rm resolves the path again, so a link
+  // swapped in between is not caught; the check narrows that window, it cannot close it.
+  auto removeInsideShare = [](const std::string& path) {
+    const std::string::size_type slash = path.rfind('/');
+    struct stat st;
+    if (slash != std::string::npos && slash > 0 && ::lstat(path.substr(0, slash).c_str(), &st) == 0 &&
+        S_ISLNK(st.st_mode)) {
+      FIDX_LOG("Skip removing %s: its directory is a symbolic link", path.c_str());
+      return;
+    }
+    RemoveTree(path);
+  };
   // What rm makes of each path is not examined; only unknown locations fail.
   std::string queuePath;
   if (!internal::ShareQueuePath(share, queuePath)) {
     FIDX_LOG("FILEIDXQueuePathGet failed, share=%s", share.c_str());
     return false;
   }
-  RemoveTree(queuePath);
-  RemoveTree(queuePath + ".tmp");
+  removeInsideShare(queuePath);
+  removeInsideShare(queuePath + ".tmp");
   std::string dbPath;
   if (!internal::ShareDbPath(share, dbPath)) {
     FIDX_LOG("FILEIDXDBPathGet failed, share=%s", share.c_str());
     return false;
   }
-  RemoveTree(dbPath);
+  removeInsideShare(dbPath);
   return true;
 }
 

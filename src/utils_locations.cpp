@@ -1,13 +1,16 @@
 // Where each share keeps its event queue and its index database: inside the share's
 // "@eaDir" directory. These C entry points report through the platform's error channel
 // only, and their log lines do not consult LOG_LEVEL.
+#include <fcntl.h>
 #include <fileindex/fileindex_c.h>
 #include <sys/stat.h>
 #include <tavo/platform.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <string>
 
 #include "internal/log.h"
 #include "internal/share_record.h"
@@ -27,6 +30,24 @@ const char kDbDirName[] = "TAVO@.fileindexdb";
     FIDX_LOG_RAW("Invaild Argument (%s)=[%d]\n", text, 0); \
     VLIBCErrSetEx(kBadArgumentError, kLogUnit, __LINE__);  \
   } while (0)
+
+// mkdir(path, mode), except that the directory holding it is not reached through a
+// symbolic link in its last component. The database directory goes into the share's
+// "@eaDir", which a share user could replace by a link to a directory elsewhere; the
+// library runs as root and must not create anything there. For a real "@eaDir" the
+// result and errno are those of mkdir; through a link it fails (ENOTDIR).
+int MakeDirBesideNoLink(const char* path, mode_t mode) {
+  const char* slash = std::strrchr(path, '/');
+  if (slash == nullptr || slash == path || slash[1] == '\0') return ::mkdir(path, mode);
+  const std::string parent(path, static_cast<size_t>(slash - path));
+  int dirFd = ::open(parent.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (dirFd < 0) return -1;
+  int rc = ::mkdirat(dirFd, slash + 1, mode);
+  int savedErrno = errno;
+  ::close(dirFd);
+  errno = savedErrno;
+  return rc;
+}
 
 // The "@eaDir" of the share is made (best effort) and the path written into the caller's
 // buffer, cut as snprintf cuts it. The share record is freed on every way out.
@@ -80,7 +101,7 @@ int FILEIDXDBPathGet(const char* szName, char* szOutDBPath, int cbOutLen) {
   int length = SharePathGet(szName, szOutDBPath, cbOutLen, kDbDirName);
   if (length < 0) return length;
   // Another process making the same directory at the same time is harmless.
-  if (::mkdir(szOutDBPath, 0777) != 0 && errno != EEXIST) {
+  if (MakeDirBesideNoLink(szOutDBPath, 0777) != 0 && errno != EEXIST) {
     FIDX_LOG_RAW("mkdir failed, path=%s, reason=%m", szOutDBPath);
   }
   return length;

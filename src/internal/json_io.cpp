@@ -1,6 +1,7 @@
 #include "internal/json_io.h"
 
 #include <fcntl.h>
+#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -78,6 +79,32 @@ bool HasSlashOutsideStrings(const char* p, const char* end) {
   return false;
 }
 
+// The configuration files' mode, set before any byte is written, then the text, synced.
+bool WriteSynced(int fd, const std::string& text) {
+  return ::fchmod(fd, 0644) == 0 && WriteFully(fd, text.data(), text.size()) && ::fsync(fd) == 0;
+}
+
+// Gives the unnamed (O_TMPFILE) file fd a fresh name beside path, in the form mkstemp
+// uses. Linking by descriptor needs CAP_DAC_READ_SEARCH (the library runs as root);
+// /proc serves other callers.
+bool LinkUnnamed(int fd, const std::string& path, std::string& name) {
+  static const char kLetters[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789";
+  char procPath[64];
+  std::snprintf(procPath, sizeof(procPath), "/proc/self/fd/%d", fd);
+  for (int attempt = 0; attempt < 100; ++attempt) {
+    unsigned char random[6];
+    if (::getrandom(random, sizeof(random), 0) != static_cast<ssize_t>(sizeof(random))) return false;
+    name = path + ".";
+    for (unsigned char r : random) name += kLetters[r % (sizeof(kLetters) - 1)];
+    if (::linkat(fd, "", AT_FDCWD, name.c_str(), AT_EMPTY_PATH) == 0) return true;
+    if (errno != EEXIST && ::linkat(AT_FDCWD, procPath, AT_FDCWD, name.c_str(), AT_SYMLINK_FOLLOW) == 0) {
+      return true;
+    }
+    if (errno != EEXIST) return false;
+  }
+  return false;
+}
+
 std::string DirectoryOf(const std::string& path) {
   std::string::size_type slash = path.rfind('/');
   if (slash == std::string::npos) return ".";
@@ -127,19 +154,41 @@ std::string JsonToString(const Json::Value& value) {
 
 bool JsonToFile(const Json::Value& value, const std::string& path) {
   const std::string text = JsonToString(value);
-  std::string tmpl = path + ".XXXXXX";
-  // mkostemp creates the file exclusively (never through a planted link) and gets the configuration files' mode before any byte is written.
-  int fd = ::mkostemp(&tmpl[0], O_CLOEXEC);
-  if (fd < 0) return false;
-  bool ok = ::fchmod(fd, 0644) == 0 && WriteFully(fd, text.data(), text.size()) &&
-            ::fsync(fd) == 0;
-  ok = (::close(fd) == 0) && ok;
-  if (ok) ok = ::rename(tmpl.c_str(), path.c_str()) == 0;
-  if (!ok) {
-    ::unlink(tmpl.c_str());
+  const std::string dir = DirectoryOf(path);
+  std::string temporary;
+  // Preferably the text is written and synced into an unnamed file of the directory
+  // (O_TMPFILE), named only just before the rename: a process killed while writing (the
+  // long part of a save) then leaves nothing behind, where a named temporary file would
+  // stay in the configuration directory for good. File systems without O_TMPFILE, or a
+  // file that cannot be named, take the named temporary file below.
+  int fd = ::open(dir.c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, 0644);
+  if (fd >= 0) {
+    const bool written = WriteSynced(fd, text);
+    const bool named = written && LinkUnnamed(fd, path, temporary);
+    const bool closed = ::close(fd) == 0;
+    if (!written || (named && !closed)) {
+      if (named) ::unlink(temporary.c_str());
+      return false;
+    }
+    if (!named) temporary.clear();
+  }
+  if (temporary.empty()) {
+    temporary = path + ".XXXXXX";
+    // mkostemp creates the file exclusively (never through a planted link).
+    fd = ::mkostemp(&temporary[0], O_CLOEXEC);
+    if (fd < 0) return false;
+    bool ok = WriteSynced(fd, text);
+    ok = (::close(fd) == 0) && ok;
+    if (!ok) {
+      ::unlink(temporary.c_str());
+      return false;
+    }
+  }
+  if (::rename(temporary.c_str(), path.c_str()) != 0) {
+    ::unlink(temporary.c_str());
     return false;
   }
-  int dirfd = ::open(DirectoryOf(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  int dirfd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   if (dirfd >= 0) {
     ::fsync(dirfd);
     ::close(dirfd);
