@@ -14,10 +14,12 @@ namespace FILEINDEX {
 namespace {
 const char kLogUnit[] = "index_mgr";
 
-// Byte-wise, case-sensitive, no normalisation; the callers append "/" to both sides so
-// that matches fall on whole path components.
-bool StartsWith(const std::string& s, const std::string& prefix) {
-  return s.size() >= prefix.size() && s.compare(0, prefix.size(), prefix) == 0;
+// Whether inner + "/" starts with outer + "/": byte-wise, case-sensitive, no
+// normalisation, so matches fall on whole path components. Computed without building
+// the two strings, since a query compares against every folder.
+bool LiesIn(const std::string& inner, const std::string& outer) {
+  if (inner.size() < outer.size() || inner.compare(0, outer.size(), outer) != 0) return false;
+  return inner.size() == outer.size() || inner[outer.size()] == '/';
 }
 }  // namespace
 
@@ -35,9 +37,8 @@ bool IndexMgr::IsPathIndexed(const std::string& path) {
 }
 
 bool IndexMgr::IsPathIndexed(const std::string& path, const std::vector<Folder>& folders) {
-  const std::string query = path + "/";
   for (const Folder& folder : folders) {
-    if (StartsWith(query, folder.GetPath() + "/")) return true;
+    if (LiesIn(path, folder.GetPath())) return true;
   }
   return false;
 }
@@ -49,9 +50,8 @@ bool IndexMgr::IsFullPathIndexed(const std::string& full) {
 }
 
 bool IndexMgr::IsFullPathIndexed(const std::string& full, const std::vector<Folder>& folders) {
-  const std::string query = full + "/";
   for (const Folder& folder : folders) {
-    if (StartsWith(query, folder.GetFullPath() + "/")) return true;
+    if (LiesIn(full, folder.GetFullPath())) return true;
   }
   return false;
 }
@@ -63,9 +63,8 @@ bool IndexMgr::IsPathContainIndexed(const std::string& path) {
 }
 
 bool IndexMgr::IsPathContainIndexed(const std::string& path, const std::vector<Folder>& folders) {
-  const std::string query = path + "/";
   for (const Folder& folder : folders) {
-    if (StartsWith(folder.GetPath() + "/", query)) return true;
+    if (LiesIn(folder.GetPath(), path)) return true;
   }
   return false;
 }
