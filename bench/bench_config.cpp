@@ -74,12 +74,12 @@ struct ListingEnv {
   ListingEnv() {
     Conf().root.Activate();
     for (unsigned s = 0; s < kShares; ++s) {
-      QueueSpec spec;
-      spec.shareFull = Conf().root.Full("/" + ShareName(s));
-      spec.folder = "dir00" + std::to_string(s);
-      spec.lines = kListingQueueLines;
-      spec.seed = s + 1;
-      WriteQueue(Conf().root.QueuePath(ShareName(s)), spec);
+      QueueRecipe recipe;
+      recipe.shareFull = Conf().root.Full("/" + ShareName(s));
+      recipe.folder = "dir00" + std::to_string(s);
+      recipe.lines = kListingQueueLines;
+      recipe.seed = s + 1;
+      WriteQueue(Conf().root.QueuePath(ShareName(s)), recipe);
     }
   }
 };

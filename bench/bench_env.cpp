@@ -62,15 +62,15 @@ std::string SubDir(Rng& rng) {
 
 class LineMaker {
  public:
-  explicit LineMaker(const QueueSpec& spec) : spec_(spec), rng_(spec.seed) {
-    dirs_ = {spec.folder, spec.folder + "x", "2018", "misc", "Family Album", "video"};
+  explicit LineMaker(const QueueRecipe& recipe) : recipe_(recipe), rng_(recipe.seed) {
+    dirs_ = {recipe.folder, recipe.folder + "x", "2018", "misc", "Family Album", "video"};
   }
 
   std::string Path() {
     // The folder of interest holds about a third of the events, its sibling a tenth.
     const unsigned pick = rng_.Below(100);
     const std::string& dir = pick < 33 ? dirs_[0] : pick < 43 ? dirs_[1] : dirs_[2 + rng_.Below(4)];
-    return spec_.shareFull + "/" + dir + "/" + SubDir(rng_) + "/" + FileName(rng_);
+    return recipe_.shareFull + "/" + dir + "/" + SubDir(rng_) + "/" + FileName(rng_);
   }
 
   std::string Valid() {
@@ -80,8 +80,8 @@ class LineMaker {
       return "{\"event\":256,\"path\":\"" + path + "\",\"path_old\":\"" + Path() + "\"}";
     }
     if (kind < 12) {
-      return "{\"event\":131072,\"path\":\"" + spec_.shareFull + "/" + spec_.folder +
-             "\",\"data\":{\"path\":\"/x/" + spec_.folder + "\",\"name\":\"" + spec_.folder +
+      return "{\"event\":131072,\"path\":\"" + recipe_.shareFull + "/" + recipe_.folder +
+             "\",\"data\":{\"path\":\"/x/" + recipe_.folder + "\",\"name\":\"" + recipe_.folder +
              "\",\"document\":true,\"audio\":false,\"video\":true,\"photo\":true}}";
     }
     if (kind < 13) return "{\"event\":65536,\"path\":\"" + path + "\",\"data\":null}";
@@ -112,10 +112,10 @@ class LineMaker {
     }
   }
 
-  bool Broken() { return spec_.malformedPerMille > 0 && rng_.Below(1000) < spec_.malformedPerMille; }
+  bool Broken() { return recipe_.malformedPerMille > 0 && rng_.Below(1000) < recipe_.malformedPerMille; }
 
  private:
-  const QueueSpec& spec_;
+  const QueueRecipe& recipe_;
   Rng rng_;
   std::vector<std::string> dirs_;
 };
@@ -155,13 +155,13 @@ std::string Sysroot::QueuePath(const std::string& share) const {
   return Full("/" + share + "/@eaDir/TAVO@file_index_queue");
 }
 
-QueueStats WriteQueue(const std::string& path, const QueueSpec& spec, const std::string& extraLines) {
+QueueStats WriteQueue(const std::string& path, const QueueRecipe& recipe, const std::string& extraLines) {
   std::FILE* out = std::fopen(path.c_str(), "wb");
   if (out == nullptr) throw std::runtime_error("cannot write " + path);
-  LineMaker maker(spec);
+  LineMaker maker(recipe);
   QueueStats stats;
   std::string chunk;
-  for (uint64_t i = 0; i < spec.lines; ++i) {
+  for (uint64_t i = 0; i < recipe.lines; ++i) {
     if (maker.Broken()) {
       chunk += maker.Malformed();
       ++stats.malformed;
@@ -178,7 +178,7 @@ QueueStats WriteQueue(const std::string& path, const QueueSpec& spec, const std:
   chunk += extraLines;
   std::fwrite(chunk.data(), 1, chunk.size(), out);
   stats.bytes += chunk.size();
-  stats.lines = spec.lines;
+  stats.lines = recipe.lines;
   if (std::fclose(out) != 0) throw std::runtime_error("cannot write " + path);
   return stats;
 }

@@ -60,7 +60,7 @@ class Rng {
 // them), renames with "path_old" in and out of the folder, settings and reindex events,
 // names in plain ASCII, raw UTF-8 and \u escapes. malformedPerMille lines in a thousand
 // are broken the ways a queue breaks (cut short, garbage, wrong types, trailing bytes).
-struct QueueSpec {
+struct QueueRecipe {
   std::string shareFull;  // the share's directory
   std::string folder;     // the folder of interest, a directory name in the share
   uint64_t lines = 0;
@@ -75,7 +75,7 @@ struct QueueStats {
 };
 
 // Writes the queue (streaming, constant memory) and then appends extraLines as they are.
-QueueStats WriteQueue(const std::string& path, const QueueSpec& spec, const std::string& extraLines = "");
+QueueStats WriteQueue(const std::string& path, const QueueRecipe& recipe, const std::string& extraLines = "");
 
 // One folder.conf record as the library stores it.
 Json::Value FolderRecord(const std::string& path, const std::string& name, unsigned flags);

@@ -24,15 +24,15 @@ const uint64_t kQueueLines = 1000000;
 // a pending reindex of the folder (so that the reindex check reads the whole file).
 struct QueueEnv {
   explicit QueueEnv(unsigned malformedPerMille) {
-    QueueSpec spec;
-    spec.shareFull = root.AddShare("photo");
-    spec.folder = "2019";
-    spec.lines = kQueueLines;
-    spec.malformedPerMille = malformedPerMille;
+    QueueRecipe recipe;
+    recipe.shareFull = root.AddShare("photo");
+    recipe.folder = "2019";
+    recipe.lines = kQueueLines;
+    recipe.malformedPerMille = malformedPerMille;
     root.MakeFolder("/photo/2019");
     folderFull = root.Full("/photo/2019");
     queue = root.QueuePath("photo");
-    stats = WriteQueue(queue, spec, "{\"event\":65536,\"path\":\"" + folderFull + "\",\"data\":null}\n");
+    stats = WriteQueue(queue, recipe, "{\"event\":65536,\"path\":\"" + folderFull + "\",\"data\":null}\n");
     record = FolderRecord("/photo/2019", "2019", 15);
   }
   Sysroot root;

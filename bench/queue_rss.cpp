@@ -75,16 +75,16 @@ int main(int argc, char** argv) {
   if (argc == 3 && std::strcmp(argv[1], "--scan") == 0) return Scan(argv[2]);
   const unsigned long megabytes = argc > 1 ? std::strtoul(argv[1], nullptr, 10) : 1024;
   bench::Sysroot root;
-  bench::QueueSpec spec;
-  spec.shareFull = root.AddShare("photo");
-  spec.folder = "2019";
+  bench::QueueRecipe recipe;
+  recipe.shareFull = root.AddShare("photo");
+  recipe.folder = "2019";
   root.MakeFolder("/photo/2019");
   const std::string queue = root.QueuePath("photo");
   // Lines enough for the size asked, from the average of a sample.
-  spec.lines = 10000;
-  const uint64_t sample = bench::WriteQueue(queue, spec).bytes;
-  spec.lines = megabytes * 1000000ULL * 10000 / sample;
-  const bench::QueueStats stats = bench::WriteQueue(queue, spec);
+  recipe.lines = 10000;
+  const uint64_t sample = bench::WriteQueue(queue, recipe).bytes;
+  recipe.lines = megabytes * 1000000ULL * 10000 / sample;
+  const bench::QueueStats stats = bench::WriteQueue(queue, recipe);
   std::printf("generated %llu lines\n", static_cast<unsigned long long>(stats.lines));
   std::fflush(stdout);
 

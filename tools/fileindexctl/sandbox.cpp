@@ -16,7 +16,7 @@ namespace fileindexctl {
 
 namespace {
 
-struct ShareSpec {
+struct ShareLayout {
   const char* name;
   const char* volume;
   bool readOnly;
@@ -26,7 +26,7 @@ struct ShareSpec {
 };
 
 // Two volumes; docs is read-only and vault encrypted (and locked), so neither may be indexed.
-const ShareSpec kShares[] = {
+const ShareLayout kShares[] = {
     {"photo",
      "/volume1",
      false,
@@ -101,14 +101,14 @@ std::string FindProbe() {
 Json::Value ShareTable() {
   Json::Value table;
   table["shares"] = Json::Value(Json::arrayValue);
-  for (const ShareSpec& spec : kShares) {
+  for (const ShareLayout& layout : kShares) {
     Json::Value share;
-    share["name"] = spec.name;
-    share["path"] = std::string(spec.volume) + "/" + spec.name;
-    share["readonly"] = spec.readOnly;
-    share["encrypted"] = spec.encrypted;
-    share["encryption"] = spec.encrypted;
-    share["recycle_bin"] = spec.recycleBin;
+    share["name"] = layout.name;
+    share["path"] = std::string(layout.volume) + "/" + layout.name;
+    share["readonly"] = layout.readOnly;
+    share["encrypted"] = layout.encrypted;
+    share["encryption"] = layout.encrypted;
+    share["recycle_bin"] = layout.recycleBin;
     table["shares"].append(share);
   }
   return table;
@@ -125,9 +125,9 @@ std::string SambaConf() {
       "\tserver string = Sandbox NAS\n"
       "\t; log level = 3\n"
       "\tlog level = 1\n";
-  for (const ShareSpec& spec : kShares) {
-    text += std::string("\n[") + spec.name + "]\n\tpath = " + spec.volume + "/" + spec.name +
-            "\n\tread only = " + (spec.readOnly ? "yes" : "no") + "\n";
+  for (const ShareLayout& layout : kShares) {
+    text += std::string("\n[") + layout.name + "]\n\tpath = " + layout.volume + "/" + layout.name +
+            "\n\tread only = " + (layout.readOnly ? "yes" : "no") + "\n";
   }
   return text;
 }
@@ -227,10 +227,10 @@ int Init(Session& s, const std::string& dir, const std::string& probeOption, boo
                           "/run/tavotifyd", "/etc/tavo/services"}) {
     ok = ok && MakeDirs(root + sub);
   }
-  for (const ShareSpec& spec : kShares) {
-    const std::string share = root + spec.volume + "/" + spec.name;
+  for (const ShareLayout& layout : kShares) {
+    const std::string share = root + layout.volume + "/" + layout.name;
     ok = ok && MakeDirs(share);
-    for (const char* file : spec.files) ok = ok && WriteFile(share + "/" + file, std::string(file) + "\n");
+    for (const char* file : layout.files) ok = ok && WriteFile(share + "/" + file, std::string(file) + "\n");
   }
   // A link inside a share: the indexing rules refuse paths through it.
   const std::string link = root + "/volume1/photo/latest";
@@ -255,9 +255,9 @@ int Init(Session& s, const std::string& dir, const std::string& probeOption, boo
   return s.Finish(result, [&]() {
     std::printf("sandbox ready in %s\n", root.c_str());
     Table table({"SHARE", "DIRECTORY", "READ-ONLY", "ENCRYPTED", "RECYCLE BIN"});
-    for (const ShareSpec& spec : kShares) {
-      table.AddRow({spec.name, root + spec.volume + "/" + spec.name, YesNo(spec.readOnly),
-                    YesNo(spec.encrypted), YesNo(spec.recycleBin)});
+    for (const ShareLayout& layout : kShares) {
+      table.AddRow({layout.name, root + layout.volume + "/" + layout.name, YesNo(layout.readOnly),
+                    YesNo(layout.encrypted), YesNo(layout.recycleBin)});
     }
     table.Print(stdout);
     std::printf("daemon probe: %s (started as the service fileindexd)\n", probe.c_str());
