@@ -8,6 +8,8 @@
 #include <cstddef>
 #include <cstring>
 #include <map>
+#include <memory>
+#include <vector>
 
 #include "support/sysroot_test.h"
 
@@ -15,20 +17,14 @@ using namespace TAVO::FILEINDEX;
 
 namespace {
 
-// Mirrors of the documented layouts.
 struct ConfigMirror {
   void* vptr;
   Json::Value document;
   int lockDescriptor;
 };
 struct FolderMirror {
-  std::string fullPath;
-  std::string path;
-  std::string name;
-  bool document;
-  bool audio;
-  bool video;
-  bool photo;
+  std::string fullPath, path, name;
+  bool document, audio, video, photo;
 };
 struct FoldersMirror {
   ConfigMirror base;
@@ -42,8 +38,8 @@ static_assert(sizeof(Status) == sizeof(ConfigMirror), "Status adds no members");
 static_assert(std::is_polymorphic<Config>::value && std::is_abstract<Config>::value, "Config is abstract");
 static_assert(!std::is_polymorphic<Folder>::value, "Folder has no vtable");
 
-// Itanium C++ ABI: a pointer to a virtual member function holds 1 + the byte offset of
-// its slot in the vtable. Slots 0 and 1 are the complete and deleting destructors.
+// Itanium ABI: a virtual member-function pointer holds 1 + its slot's byte offset in the
+// vtable; slots 0 and 1 are the destructors.
 template <typename PMF>
 std::ptrdiff_t VirtualSlot(PMF pmf) {
   std::ptrdiff_t raw[2];
@@ -53,14 +49,13 @@ std::ptrdiff_t VirtualSlot(PMF pmf) {
   return (raw[0] - 1) / static_cast<std::ptrdiff_t>(sizeof(void*));
 }
 
-class LayoutTest : public SysrootTest {};
+using LayoutTest = SysrootTest;
 
-class ProbeConfig : public Config {
- public:
-  bool Load() override { return LoadJson(); }
-  bool Save() override { return SaveJson(); }
-  std::string GetLockPath() const override { return "lock"; }
-  std::string GetPath() const override { return "path"; }
+struct ProbeConfig : Config {
+  bool Load() override { return false; }
+  bool Save() override { return false; }
+  std::string GetLockPath() const override { return ""; }
+  std::string GetPath() const override { return ""; }
   const void* DocumentAddress() const { return &m_jsDocument; }
   const void* LockAddress() const { return &m_fdLock; }
 };
@@ -68,62 +63,38 @@ class ProbeConfig : public Config {
 }  // namespace
 
 TEST_F(LayoutTest, VirtualFunctionsKeepTheirSlots) {
-  EXPECT_EQ(VirtualSlot(&Config::Load), 2);
-  EXPECT_EQ(VirtualSlot(&Config::Save), 3);
-  EXPECT_EQ(VirtualSlot(&Config::GetLockPath), 4);
-  EXPECT_EQ(VirtualSlot(&Config::GetPath), 5);
-  for (auto slot : {VirtualSlot(&Folders::Load), VirtualSlot(&Status::Load)}) EXPECT_EQ(slot, 2);
-  for (auto slot : {VirtualSlot(&Folders::Save), VirtualSlot(&Status::Save)}) EXPECT_EQ(slot, 3);
-  for (auto slot : {VirtualSlot(&Folders::GetLockPath), VirtualSlot(&Status::GetLockPath)}) EXPECT_EQ(slot, 4);
-  for (auto slot : {VirtualSlot(&Folders::GetPath), VirtualSlot(&Status::GetPath)}) EXPECT_EQ(slot, 5);
+  EXPECT_EQ(std::vector<std::ptrdiff_t>({VirtualSlot(&Config::Load), VirtualSlot(&Config::Save),
+                                         VirtualSlot(&Config::GetLockPath), VirtualSlot(&Config::GetPath),
+                                         VirtualSlot(&Folders::Load), VirtualSlot(&Status::Save),
+                                         VirtualSlot(&Folders::GetLockPath), VirtualSlot(&Status::GetPath)}),
+            std::vector<std::ptrdiff_t>({2, 3, 4, 5, 2, 3, 4, 5}));
 }
 
+// Virtual calls and the deleting destructor through the base reach the subclasses.
 TEST_F(LayoutTest, CallsThroughTheBaseReachTheSubclassesInSlotOrder) {
-  AddShare("photo");
-  WriteFile(FolderConfPath(), R"({"/photo/a":{"name":"a","document":true}})");
-  Config* configs[] = {new Folders(), new Status()};
-  EXPECT_EQ(configs[0]->GetPath(), FolderConfPath());
-  EXPECT_EQ(configs[0]->GetLockPath(), Rooted("/tmp/fileidx_cfg_folder.lock"));
-  EXPECT_EQ(configs[1]->GetPath(), StatusConfPath());
-  EXPECT_EQ(configs[1]->GetLockPath(), Rooted("/tmp/fileidx_cfg_status.lock"));
-  for (Config* config : configs) {
-    EXPECT_TRUE(config->Load());
-    EXPECT_TRUE(config->Save());
-    delete config;  // the deleting destructor, through the base
-  }
-  EXPECT_EQ(ReadJson(FolderConfPath())["/photo/a"]["document"], true);
-  EXPECT_TRUE(Exists(StatusConfPath()));
+  std::unique_ptr<Config> folders(new Folders()), status(new Status());
+  EXPECT_EQ(folders->GetPath() + "|" + folders->GetLockPath(), FolderConfPath() + "|" + Rooted("/tmp/fileidx_cfg_folder.lock"));
+  EXPECT_EQ(status->GetPath() + "|" + status->GetLockPath(), StatusConfPath() + "|" + Rooted("/tmp/fileidx_cfg_status.lock"));
+  EXPECT_TRUE(folders->Load() && folders->Save() && status->Load() && status->Save());
+  EXPECT_TRUE(Exists(FolderConfPath()) && Exists(StatusConfPath()));
 }
 
 TEST_F(LayoutTest, MembersSitInTheirDocumentedOrder) {
   ProbeConfig config;
   ConfigMirror mirror;
-  auto offset = [](const void* member, const void* object) {
-    return static_cast<const char*>(member) - static_cast<const char*>(object);
-  };
+  auto offset = [](const void* m, const void* o) { return static_cast<const char*>(m) - static_cast<const char*>(o); };
   EXPECT_EQ(offset(config.DocumentAddress(), &config), offset(&mirror.document, &mirror));
   EXPECT_EQ(offset(config.LockAddress(), &config), offset(&mirror.lockDescriptor, &mirror));
   EXPECT_EQ(*static_cast<const int*>(config.LockAddress()), -1);
-
-  // Reading a Folder through its mirror shows each member where the layout puts it;
-  // the flags are set to a pattern that tells them apart.
+  // A Folder read through its mirror; the flags set to a pattern that tells them apart.
   AddShare("photo");
   Folder folder;
-  Json::Value record;
-  record["name"] = "holiday";
-  record["document"] = true;
-  record["audio"] = false;
-  record["video"] = true;
-  record["photo"] = false;
-  ASSERT_TRUE(folder.Load("/photo/2019", record));
+  ASSERT_TRUE(folder.Load("/photo/2019", ParseJson(R"({"name":"holiday","document":true,"audio":false,"video":true,"photo":false})")));
   FolderMirror seen;
   std::memcpy(static_cast<void*>(&seen.document), reinterpret_cast<const char*>(&folder) + offsetof(FolderMirror, document), 4);
   const std::string* strings = reinterpret_cast<const std::string*>(&folder);
-  EXPECT_EQ(strings[0], Rooted("/volume1/photo/2019"));
-  EXPECT_EQ(strings[1], "/photo/2019");
-  EXPECT_EQ(strings[2], "holiday");
-  EXPECT_TRUE(seen.document);
-  EXPECT_FALSE(seen.audio);
-  EXPECT_TRUE(seen.video);
-  EXPECT_FALSE(seen.photo);
+  EXPECT_EQ(std::vector<std::string>(strings, strings + 3),
+            (std::vector<std::string>{Rooted("/volume1/photo/2019"), "/photo/2019", "holiday"}));
+  EXPECT_EQ(std::vector<bool>({seen.document, seen.audio, seen.video, seen.photo}),
+            std::vector<bool>({true, false, true, false}));
 }
