@@ -17,10 +17,8 @@
 #include <functional>
 #include <random>
 #include <set>
-#include <sstream>
 
 #include "internal/json_io.h"
-#include "internal/queue_scan.h"
 #include "support/index_mgr_test.h"
 
 using namespace TAVO::FILEINDEX;
@@ -34,20 +32,16 @@ const char* const kShares[] = {"photo", "video"};
 struct Children {
   std::vector<pid_t> pids;
   ~Children() {
-    for (pid_t pid : pids) {
+    for (pid_t pid : pids)
       if (pid > 0 && ::kill(pid, SIGKILL) == 0) ::waitpid(pid, nullptr, 0);
-    }
   }
   void Spawn(const int gate[2], const std::function<void()>& body) {
     pid_t pid = ::fork();
     if (pid == 0) {
-      ::prctl(PR_SET_PDEATHSIG, SIGKILL);
-      ::alarm(90);
+      ::prctl(PR_SET_PDEATHSIG, SIGKILL), ::alarm(90);
       std::srand(static_cast<unsigned>(::getpid()));  // own lock back-off sleeps
       ::close(gate[1]);
-      char c;
-      while (::read(gate[0], &c, 1) < 0 && errno == EINTR) {
-      }
+      for (char c; ::read(gate[0], &c, 1) < 0 && errno == EINTR;) continue;
       body();
       ::_exit(0);
     }
@@ -75,120 +69,91 @@ class ConcurrencyTest : public IndexMgrTest {
                   Record("/video/base", "base", true, true, true, true)});
   }
   std::string ReportPath(const std::string& who) const { return Rooted("/report-" + who + ".json"); }
-  void RunWriter(int writer);
-  void RunReader(int reader);
+  // Mixed calls on the writer's own folders, share flag and queue. The model records what
+  // each successful call left; a failed one must fail with code 9 and is taken as no change.
+  void RunWriter(int writer) {
+    std::mt19937 rng(1000 + writer);
+    auto pick = [&rng](int n) { return static_cast<int>(rng() % static_cast<unsigned>(n)); };
+    const std::string flagShare = "w" + std::to_string(writer);
+    Json::Value report(Json::objectValue);
+    for (int n = 0; n < kOpsPerWriter; ++n) {
+      const int k = pick(4);
+      const std::string path = "/" + std::string(kShares[k % 2]) + "/" + flagShare + "-" + std::to_string(k);
+      const int choice = pick(100);
+      bool ok = false, lockable = choice < 55 || choice >= 75;
+      ErrorHandler::g_error_code = FILEINDEX_ERR_NONE;
+      if (choice < 35) {
+        const auto records =
+            Array({Record(path, "n" + std::to_string(n), pick(2), pick(2), pick(2), pick(2))});
+        ok = pick(2) ? IndexMgr::Upsert(records) : IndexMgr::Set(records);
+        if (ok) report["folders"][path] = true;
+      } else if (choice < 55) {
+        if ((ok = IndexMgr::Delete(Array({Json::Value(path)})))) report["folders"][path] = false;
+      } else if (choice < 75) {
+        ok = AddCustomEvent(131072, Full("/photo/events-" + flagShare), Json::Value(n));
+      } else {
+        const bool set = pick(2) != 0;
+        if ((ok = StatusMgr::ShareSetNeedReindex(flagShare, set))) report["needReindex"] = set;
+      }
+      if (!ok && !(lockable && ErrorHandler::GetError() == FILEINDEX_ERR_LOCK))
+        report["errors"].append(std::to_string(choice) + ": " + std::to_string(ErrorHandler::GetError()));
+      report["succeeded"] = report["succeeded"].asInt() + (ok ? 1 : 0);
+    }
+    std::ofstream(ReportPath(flagShare)) << internal::JsonToString(report);
+  }
+  // Queries until told to stop; what readers see is only ever what a save left on disk.
+  void RunReader(int reader) {
+    Json::Value errors(Json::arrayValue);
+    auto fail = [&errors](const std::string& what) {
+      if (errors.size() < 20) errors.append(what + ": " + std::to_string(ErrorHandler::GetError()));
+    };
+    while (!Exists(Rooted("/stop"))) {  // the child's alarm bounds it too
+      ErrorHandler::g_error_code = FILEINDEX_ERR_NONE;
+      for (const std::string& file : {FolderConfPath(), StatusConfPath()}) {
+        Json::Value doc;
+        if (Exists(file) && !internal::JsonFromString(doc, ReadFile(file))) fail("torn " + file);
+      }
+      std::vector<Folder> folders;
+      if (!IndexMgr::List(folders) || folders.size() < 2) fail("IndexMgr::List");
+      Json::Value got;  // Get waits on folder.conf's lock and may give up with code 9
+      if (IndexMgr::Get(got, "/video/base") ? got["name"] != "base" : ErrorHandler::GetError() != 9)
+        fail("Get");
+    }
+    std::ofstream(ReportPath("r" + std::to_string(reader))) << internal::JsonToString(errors);
+  }
 };
 
-// Mixed calls on the writer's own folders, share flag and queue. The model records what
-// each successful call left; a failed one must fail with code 9 and is taken as no change.
-void ConcurrencyTest::RunWriter(int writer) {
-  std::mt19937 rng(1000 + writer);
-  auto pick = [&rng](int n) { return static_cast<int>(rng() % static_cast<unsigned>(n)); };
-  const std::string flagShare = "w" + std::to_string(writer);
-  Json::Value report(Json::objectValue);
-  for (int n = 0; n < kOpsPerWriter; ++n) {
-    const int k = pick(4);
-    const std::string path =
-        std::string("/") + kShares[k % 2] + "/w" + std::to_string(writer) + "-" + std::to_string(k);
-    const int choice = pick(100);
-    bool ok = false, lockable = true;
-    ErrorHandler::g_error_code = FILEINDEX_ERR_NONE;
-    if (choice < 35) {
-      Json::Value records =
-          Array({Record(path, "n" + std::to_string(n), pick(2), pick(2), pick(2), pick(2))});
-      ok = pick(2) ? IndexMgr::Upsert(records) : IndexMgr::Set(records);
-      if (ok) report["folders"][path] = true;
-    } else if (choice < 55) {
-      ok = IndexMgr::Delete(Array({Json::Value(path)}));
-      if (ok) report["folders"][path] = false;
-    } else if (choice < 75) {
-      Json::Value data(Json::objectValue);
-      data["seq"] = n;
-      lockable = false;
-      ok = AddCustomEvent(131072, Full("/photo/events-" + flagShare), data);
-    } else {
-      const bool set = pick(2) != 0;
-      ok = StatusMgr::ShareSetNeedReindex(flagShare, set);
-      if (ok) report["needReindex"] = set;
-    }
-    if (!ok && !(lockable && ErrorHandler::GetError() == FILEINDEX_ERR_LOCK)) {
-      report["errors"].append(std::to_string(choice) + ": " + std::to_string(ErrorHandler::GetError()));
-    }
-    report["succeeded"] = report["succeeded"].asInt() + (ok ? 1 : 0);
-  }
-  std::ofstream(ReportPath(flagShare)) << internal::JsonToString(report);
-}
-
-// Queries until told to stop; what readers see is only ever what a save left on disk.
-void ConcurrencyTest::RunReader(int reader) {
-  Json::Value errors(Json::arrayValue);
-  auto fail = [&errors](const std::string& what) {
-    if (errors.size() < 20) errors.append(what + ": " + std::to_string(ErrorHandler::GetError()));
-  };
-  while (!Exists(Rooted("/stop"))) {  // the child's alarm bounds it too
-    ErrorHandler::g_error_code = FILEINDEX_ERR_NONE;
-    for (const std::string& file : {FolderConfPath(), StatusConfPath()}) {
-      Json::Value doc;
-      if (Exists(file) && (!internal::JsonFromString(doc, ReadFile(file)) || !doc.isObject()))
-        fail("torn " + file);
-    }
-    std::vector<Folder> folders;
-    if (!IndexMgr::List(folders) || folders.size() < 2) fail("IndexMgr::List");
-    Json::Value got;  // Get waits on folder.conf's lock and may give up with code 9
-    if (IndexMgr::Get(got, "/video/base") ? got["name"] != "base" : ErrorHandler::GetError() != 9)
-      fail("Get");
-    for (const char* share : kShares) {  // whole lines only: an append may be under way
-      std::istringstream queue(ReadFile(Queue(share)));
-      internal::QueueEvent event;
-      for (std::string line; std::getline(queue, line) && !queue.eof();) {
-        if (!internal::ParseQueueLine(line.data(), line.size(), event)) fail("queue line " + line);
-      }
-    }
-  }
-  std::ofstream(ReportPath("r" + std::to_string(reader))) << internal::JsonToString(errors);
-}
-
 TEST_F(ConcurrencyTest, WritersAndReadersInSeveralProcesses) {
-  // Children are forked before the fake daemon's thread exists and wait at a gate that opens
-  // once it listens.
+  // Children fork before the fake daemon's thread exists, then wait at a gate until it listens.
   int gate[2];
   ASSERT_EQ(::pipe2(gate, O_CLOEXEC), 0);
   Children children;
-  for (int i = 0; i < kReaders + kWriters; ++i) {
+  for (int i = 0; i < kReaders + kWriters; ++i)
     children.Spawn(gate, [&, i] { i < kReaders ? RunReader(i) : RunWriter(i - kReaders); });
-  }
   StartDaemon();
-  ::close(gate[1]);
-  ::close(gate[0]);
+  ::close(gate[1]), ::close(gate[0]);
   for (int i = kReaders; i < kReaders + kWriters; ++i) EXPECT_EQ(children.Wait(i), 0) << "writer " << i;
   WriteFile(Rooted("/stop"), "");
   for (int i = 0; i < kReaders; ++i) {
     EXPECT_EQ(children.Wait(i), 0) << "reader " << i;
     EXPECT_EQ(ReadJson(ReportPath("r" + std::to_string(i))), Json::Value(Json::arrayValue)) << "reader " << i;
   }
-
   // folder.conf and status.conf hold exactly what each writer's successful calls left.
   std::set<std::string> expected{"/photo/base", "/video/base"};
   Json::Value status = ReadJson(StatusConfPath());
   for (int w = 0; w < kWriters; ++w) {
     const std::string name = "w" + std::to_string(w);
     Json::Value report = ReadJson(ReportPath(name));
-    // Contention must not starve a writer.
-    ASSERT_GT(report["succeeded"].asInt(), kOpsPerWriter / 4) << name;
+    ASSERT_GT(report["succeeded"].asInt(), kOpsPerWriter / 4) << name;  // contention starves no writer
     EXPECT_TRUE(report["errors"].empty()) << report["errors"];
-    for (const std::string& path : report["folders"].getMemberNames()) {
+    for (const std::string& path : report["folders"].getMemberNames())
       if (report["folders"][path].asBool()) expected.insert(path);
-    }
     EXPECT_EQ(status["need_reindex"].isMember(name), report["needReindex"].asBool()) << name;
   }
-  const std::vector<std::string> names = FolderConf().getMemberNames();
-  EXPECT_EQ(std::set<std::string>(names.begin(), names.end()), expected);
-
-  // Every queue line is one whole event.
-  for (const char* share : kShares) {
-    const std::string text = ReadFile(Queue(share));
-    EXPECT_TRUE(text.empty() || text.back() == '\n') << share;
-    for (const std::string& line : ReadLines(Queue(share))) EXPECT_TRUE(ParseJson(line).isObject()) << line;
+  EXPECT_EQ(FolderConf().getMemberNames(), std::vector<std::string>(expected.begin(), expected.end()));
+  for (const char* share : kShares) {  // every queue line is one whole event
+    EXPECT_TRUE(ReadFile(Queue(share)).empty() || ReadFile(Queue(share)).back() == '\n') << share;
+    for (const Json::Value& event : QueueEvents(share)) EXPECT_TRUE(event.isObject()) << event;
   }
 }
 

@@ -1,5 +1,4 @@
-// Hostile share contents: links (and a FIFO) planted by share users where the library keeps
-// its per-share files, links at the lock paths, and the fuzz inputs replayed as regressions.
+// Hostile share contents: links (and a FIFO) planted where the library keeps per-share files or locks.
 #include <fileindex/error.h>
 #include <fileindex/fileindex_c.h>
 #include <fileindex/index_mgr.h>
@@ -11,7 +10,6 @@
 #include <filesystem>
 #include <set>
 
-#include "../fuzz/harness.h"
 #include "support/index_mgr_test.h"
 
 using namespace TAVO::FILEINDEX;
@@ -48,12 +46,11 @@ TEST_F(HostileTest, LinksAtTheLockPathsAreNotFollowed) {
   WriteFile(outside_ + "/victim", "keep");
   Link(outside_ + "/victim", Rooted("/tmp/fileidx_cfg_status.lock"));
   EXPECT_FALSE(IndexMgr::Upsert(Array({Record("/photo/a", "a", true, true, true, true)})));
-  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_LOCK);
+  EXPECT_TRUE(ErrorHandler::GetError() == FILEINDEX_ERR_LOCK && !Exists(FolderConfPath()));
   ErrorHandler::SetError(FILEINDEX_ERR_NONE);
   EXPECT_FALSE(StatusMgr::ShareSetNeedReindex("photo", true));
   EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_LOCK);
   EXPECT_EQ(Outside(), (std::set<std::string>{"victim=keep"}));
-  EXPECT_FALSE(Exists(FolderConfPath()));
 }
 
 // A queue that is a link or a FIFO is never written (nor blocks) and marks the share for reindexing.
@@ -87,7 +84,6 @@ TEST_F(HostileTest, EaDirLinksKeepEveryWriteAndRemovalInsideTheShare) {
   EXPECT_TRUE(IndexMgr::CleanShareIndexData("photo"));
   EXPECT_FALSE(Exists(Queue("photo")) || Exists(Db("photo")));
   EXPECT_EQ(Outside(), before);
-
   ::rmdir(EaDir("photo").c_str());
   Link(outside_, EaDir("photo"));
   fake::Get().execs.clear();
@@ -99,41 +95,6 @@ TEST_F(HostileTest, EaDirLinksKeepEveryWriteAndRemovalInsideTheShare) {
   EXPECT_TRUE(IndexMgr::Delete(Array({Json::Value("/photo/a")})));  // cleans up the share
   EXPECT_TRUE(fake::Get().execs.empty());
   EXPECT_EQ(Outside(), before);
-}
-
-// The fuzz targets' seed corpora and saved crash inputs, replayed through the same checks.
-TEST_F(HostileTest, FuzzInputsKeepTheirProperties) {
-  const std::string fuzzDir = std::filesystem::path(__FILE__).parent_path().string() + "/../fuzz";
-  fuzzh::Env env{root_};
-  fuzzh::SetUpRoot(env);
-  fuzzh::SinkDaemon daemon;
-  ASSERT_TRUE(daemon.Start(env.Socket()));
-  using Check = std::string (*)(const fuzzh::Env&, const uint8_t*, size_t);
-  const std::vector<std::pair<std::string, Check>> targets = {
-      {"fuzz_queue_line",
-       [](const fuzzh::Env& e, const uint8_t* data, size_t size) {
-         std::string problem = fuzzh::CheckQueueLine(std::string(reinterpret_cast<const char*>(data), size));
-         return problem.empty() ? fuzzh::CheckQueueFile(e, data, size) : problem;
-       }},
-      {"fuzz_folders_load", fuzzh::CheckFolderConf},
-      {"fuzz_status", fuzzh::CheckStatusConf},
-      {"fuzz_index_mgr", fuzzh::CheckIndexMgr},
-  };
-  int replayed = 0;
-  for (const auto& target : targets) {
-    for (const char* kind : {"/corpus/", "/regressions/"}) {
-      const std::string dir = fuzzDir + kind + target.first;
-      if (!std::filesystem::is_directory(dir)) continue;
-      for (const auto& entry : std::filesystem::directory_iterator(dir)) {
-        if (entry.path().filename().string()[0] == '.') continue;
-        const std::string input = ReadFile(entry.path());
-        EXPECT_EQ(target.second(env, reinterpret_cast<const uint8_t*>(input.data()), input.size()), "")
-            << entry.path();
-        ++replayed;
-      }
-    }
-  }
-  EXPECT_GE(replayed, 20);
 }
 
 }  // namespace

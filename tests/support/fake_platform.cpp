@@ -79,6 +79,14 @@ void ClearClock() { g_clockSet = false; }
 
 }  // namespace fake
 
+// Records the call; a forced result for the function is returned at once.
+#define FAKE_RECORD(function, args)                                                     \
+  do {                                                                                  \
+    int forced_;                                                                        \
+    if (fake::Record(std::string(#function "(") + (args) + ")", #function, &forced_)) \
+      return forced_;                                                                   \
+  } while (0)
+
 extern "C" {
 
 time_t time(time_t* out) noexcept {
@@ -95,8 +103,7 @@ time_t time(time_t* out) noexcept {
 }
 
 int TAVOShareGet(const char* szName, PTAVOSHARE* ppShare) {
-  int forced;
-  if (fake::Record("TAVOShareGet(" + fake::Quote(szName) + ")", "TAVOShareGet", &forced)) return forced;
+  FAKE_RECORD(TAVOShareGet, fake::Quote(szName));
   auto it = fake::Get().shares.find(szName == nullptr ? "" : szName);
   if (szName == nullptr || it == fake::Get().shares.end()) {
     VLIBCErrSetEx(0x1400, "fake", 1);
@@ -123,9 +130,7 @@ void TAVOShareFree(PTAVOSHARE pShare) {
 }
 
 int TAVOShareNamePathGet(const char* szFullPath, char* szName, int cbName, char* szPath, int cbPath) {
-  int forced;
-  if (fake::Record("TAVOShareNamePathGet(" + fake::Quote(szFullPath) + ")", "TAVOShareNamePathGet", &forced))
-    return forced;
+  FAKE_RECORD(TAVOShareNamePathGet, fake::Quote(szFullPath));
   const fake::Share* best = nullptr;
   for (const auto& entry : fake::Get().shares) {
     if (fake::Inside(szFullPath, entry.second.dir) && (best == nullptr || entry.second.dir.size() > best->dir.size()))
@@ -141,9 +146,7 @@ int TAVOShareNamePathGet(const char* szFullPath, char* szName, int cbName, char*
 }
 
 int TAVOShareIsShareRecycle(const char* szFullPath) {
-  int forced;
-  if (fake::Record("TAVOShareIsShareRecycle(" + fake::Quote(szFullPath) + ")", "TAVOShareIsShareRecycle", &forced))
-    return forced;
+  FAKE_RECORD(TAVOShareIsShareRecycle, fake::Quote(szFullPath));
   return fake::Get().recyclePaths.count(szFullPath) ? 1 : 0;
 }
 
@@ -166,49 +169,39 @@ int VLIBShareIsReadOnlyGet(PTAVOSHARE pShare, int* pbl) {
 }
 
 int TAVOGetFSType(const char* szPath, int flag) {
-  int forced;
-  if (fake::Record("TAVOGetFSType(" + fake::Quote(szPath) + "," + std::to_string(flag) + ")", "TAVOGetFSType", &forced))
-    return forced;
+  FAKE_RECORD(TAVOGetFSType, fake::Quote(szPath) + "," + std::to_string(flag));
   auto it = fake::Get().fsTypes.find(szPath);
   return it == fake::Get().fsTypes.end() ? fake::Get().defaultFsType : it->second;
 }
 
 int TAVOFSIsRemoteFS(int fsType) {
-  int forced;
-  if (fake::Record("TAVOFSIsRemoteFS(" + std::to_string(fsType) + ")", "TAVOFSIsRemoteFS", &forced)) return forced;
+  FAKE_RECORD(TAVOFSIsRemoteFS, std::to_string(fsType));
   return fake::Get().remoteFsTypes.count(fsType) ? 1 : 0;
 }
 
 int TAVOFSIsImageFS(int fsType) {
-  int forced;
-  if (fake::Record("TAVOFSIsImageFS(" + std::to_string(fsType) + ")", "TAVOFSIsImageFS", &forced)) return forced;
+  FAKE_RECORD(TAVOFSIsImageFS, std::to_string(fsType));
   return fake::Get().imageFsTypes.count(fsType) ? 1 : 0;
 }
 
 int TAVOFSDirIsMntPoint(const char* szPath) {
-  int forced;
-  if (fake::Record("TAVOFSDirIsMntPoint(" + fake::Quote(szPath) + ")", "TAVOFSDirIsMntPoint", &forced)) return forced;
+  FAKE_RECORD(TAVOFSDirIsMntPoint, fake::Quote(szPath));
   return fake::Get().mountPoints.count(szPath) ? 1 : 0;
 }
 
 int VLIBFhsPathInSnapshot(const char* szPath, int* pblInSnapshot) {
-  int forced;
-  if (fake::Record("VLIBFhsPathInSnapshot(" + fake::Quote(szPath) + ")", "VLIBFhsPathInSnapshot", &forced))
-    return forced;
+  FAKE_RECORD(VLIBFhsPathInSnapshot, fake::Quote(szPath));
   *pblInSnapshot = fake::Get().snapshotPaths.count(szPath) ? 1 : 0;
   return 0;
 }
 
 int TAVOEAIsHiddenDir(const char* szName) {
-  int forced;
-  if (fake::Record("TAVOEAIsHiddenDir(" + fake::Quote(szName) + ")", "TAVOEAIsHiddenDir", &forced)) return forced;
+  FAKE_RECORD(TAVOEAIsHiddenDir, fake::Quote(szName));
   return fake::Get().hiddenDirs.count(szName) ? 1 : 0;
 }
 
 int TAVOEAMKDir(int flag, const char* szPath) {
-  int forced;
-  if (fake::Record("TAVOEAMKDir(" + std::to_string(flag) + "," + fake::Quote(szPath) + ")", "TAVOEAMKDir", &forced))
-    return forced;
+  FAKE_RECORD(TAVOEAMKDir, std::to_string(flag) + "," + fake::Quote(szPath));
   if (::mkdir(szPath, 0755) != 0 && errno != EEXIST) {
     VLIBCErrSetEx(0x100, "fake", 3);
     return -1;
@@ -256,8 +249,7 @@ int VLIBServiceRestart(const char* szService) {
 }
 
 int TAVOSMBIsEnableSpotlight(void) {
-  int forced;
-  if (fake::Record("TAVOSMBIsEnableSpotlight()", "TAVOSMBIsEnableSpotlight", &forced)) return forced;
+  FAKE_RECORD(TAVOSMBIsEnableSpotlight, "");
   return fake::Get().spotlight ? 1 : 0;
 }
 
