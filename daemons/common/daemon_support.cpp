@@ -123,8 +123,10 @@ bool EventLoop::RunOnce(std::chrono::milliseconds maxWait) {
   while (!m_due.empty() && !m_timers.count(m_due.begin()->second)) m_due.erase(m_due.begin());
   auto wait = maxWait;
   if (!m_due.empty()) {
-    auto untilDue = std::chrono::duration_cast<std::chrono::milliseconds>(m_due.begin()->first - Clock::now());
-    if (untilDue < wait) wait = untilDue < std::chrono::milliseconds(0) ? std::chrono::milliseconds(0) : untilDue;
+    auto untilDue =
+        std::chrono::duration_cast<std::chrono::milliseconds>(m_due.begin()->first - Clock::now());
+    if (untilDue < wait)
+      wait = untilDue < std::chrono::milliseconds(0) ? std::chrono::milliseconds(0) : untilDue;
   }
   epoll_event events[64];
   int n = ::epoll_wait(m_epoll, events, 64, static_cast<int>(wait.count()));

@@ -27,12 +27,12 @@
 namespace fileindex_queue {
 
 enum EventCode : std::uint32_t {
-  kCreated = 1,         // a file or directory appeared (also: moved in from outside the watched trees)
-  kModified = 2,        // a file was written and closed
-  kAttributes = 4,      // owner, mode or times changed
-  kDeleted = 8,         // a file or directory went away (also: moved out of the watched trees)
-  kRenamed = 256,       // moved within the watched trees: "path" is the new path, "path_old" the old one
-  kReindex = 65536,     // crawl the folder "path" again and reconcile (written by the library too)
+  kCreated = 1,      // a file or directory appeared (also: moved in from outside the watched trees)
+  kModified = 2,     // a file was written and closed
+  kAttributes = 4,   // owner, mode or times changed
+  kDeleted = 8,      // a file or directory went away (also: moved out of the watched trees)
+  kRenamed = 256,    // moved within the watched trees: "path" is the new path, "path_old" the old one
+  kReindex = 65536,  // crawl the folder "path" again and reconcile (written by the library too)
   kSettingsChanged = 131072,  // the folder "path" changed its settings (written by the library)
 };
 

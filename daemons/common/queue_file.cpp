@@ -109,7 +109,8 @@ TakeResult TakeQueue(const std::string& queuePath) {
     if (busy) return TakeResult::kBusy;
     return errno == ENOENT ? TakeResult::kEmpty : TakeResult::kFailed;
   }
-  TakeResult result = ::rename(queuePath.c_str(), tmp.c_str()) == 0 ? TakeResult::kTaken : TakeResult::kFailed;
+  TakeResult result =
+      ::rename(queuePath.c_str(), tmp.c_str()) == 0 ? TakeResult::kTaken : TakeResult::kFailed;
   int saved = errno;
   ::flock(fd, LOCK_UN);
   ::close(fd);

@@ -20,10 +20,10 @@ AppendResult AppendQueueLines(const std::string& queuePath, const std::vector<st
                               std::size_t& appended);
 
 enum class TakeResult {
-  kTaken,    // the queue is now the ".tmp" companion (or one was already there)
-  kEmpty,    // neither the queue nor its companion exists
-  kBusy,     // a writer holds the lock; try again later
-  kFailed,   // errno says why
+  kTaken,   // the queue is now the ".tmp" companion (or one was already there)
+  kEmpty,   // neither the queue nor its companion exists
+  kBusy,    // a writer holds the lock; try again later
+  kFailed,  // errno says why
 };
 
 // For the consumer: makes the ".tmp" companion the work in progress. A companion left by

@@ -75,21 +75,22 @@ std::string Canonical(const std::string& path) {
   return ::realpath(path.c_str(), resolved) != nullptr ? resolved : "";
 }
 
-// The daemon probe: the one this build made, else one beside this program, else on PATH.
-std::string FindProbe() {
+// A program of this project: the one this build made, else one beside this program (or
+// in the build tree's sibling folder), else on PATH.
+std::string FindProgram(const std::string& name, const char* built, const std::string& buildFolder) {
   std::vector<std::string> candidates;
-#ifdef FILEINDEXCTL_PROBE
-  candidates.push_back(FILEINDEXCTL_PROBE);
-#endif
+  if (built != nullptr && *built != '\0') candidates.push_back(built);
   std::string self = Canonical("/proc/self/exe");
   std::string dir = self.substr(0, self.rfind('/'));
-  candidates.push_back(dir + "/fileindex-probe");
-  candidates.push_back(dir + "/../probe/fileindex-probe");
+  candidates.push_back(dir + "/" + name);
+  candidates.push_back(dir + "/../" + buildFolder + "/" + name);
+  candidates.push_back(dir + "/../../" + buildFolder + "/" + name);
+  for (const char* sbin : {"/usr/sbin/", "/usr/local/sbin/"}) candidates.push_back(sbin + name);
   if (const char* path = std::getenv("PATH")) {
     std::stringstream entries(path);
     std::string entry;
     while (std::getline(entries, entry, ':')) {
-      if (!entry.empty()) candidates.push_back(entry + "/fileindex-probe");
+      if (!entry.empty()) candidates.push_back(entry + "/" + name);
     }
   }
   for (const std::string& candidate : candidates) {
@@ -97,6 +98,16 @@ std::string FindProbe() {
   }
   return "";
 }
+
+#ifndef FILEINDEXCTL_PROBE
+#define FILEINDEXCTL_PROBE ""
+#endif
+#ifndef FILEINDEXCTL_FILEINDEXD
+#define FILEINDEXCTL_FILEINDEXD ""
+#endif
+#ifndef FILEINDEXCTL_TAVOTIFYD
+#define FILEINDEXCTL_TAVOTIFYD ""
+#endif
 
 Json::Value ShareTable() {
   Json::Value table;
@@ -132,53 +143,81 @@ std::string SambaConf() {
   return text;
 }
 
-std::string DaemonHook(const std::string& root, const std::string& probe) {
+// The service hook of one of the sandbox's daemons, run by the host platform with status,
+// start, stop or restart. The daemon records its own process id (it holds an instance lock
+// on the pid file); `before` runs first on start, `after` on stop.
+struct DaemonService {
+  std::string name;
+  std::string command;     // the whole command line, quoted
+  std::string readyPath;   // start waits until this exists (empty: until the pid file does)
+  std::string before;      // shell commands run before a start
+  std::string after;       // shell commands run after a stop
+  bool recordPid = false;  // the program does not record its process id: the hook does
+  std::string logName;     // its standard output and error go to var/log/<logName>
+};
+
+std::string ServiceHook(const std::string& root, const DaemonService& service) {
+  const std::string readyTest =
+      service.readyPath.empty() ? "[ -s \"$pidfile\" ]" : "[ -S " + Quote(service.readyPath) + " ]";
   return "#!/bin/sh\n"
-         "# Service hook of the sandbox's indexing daemon \"fileindexd\", run by the host platform\n"
-         "# with status, start, stop or restart. The daemon probe stands in for the daemon: it\n"
-         "# listens on the daemon's socket and appends each command it receives to a log.\n"
+         "# Service hook of the sandbox's \"" +
+         service.name +
+         "\", run by the host platform with\n"
+         "# status, start, stop or restart.\n"
          "root=" +
          Quote(root) +
          "\n"
-         "probe=" +
-         Quote(probe) +
-         "\n"
-         "pidfile=\"$root/var/run/fileindexd.pid\"\n"
-         "socket=\"$root/var/run/fileindexd.sock\"\n"
+         "pidfile=\"$root/var/run/" +
+         service.name +
+         ".pid\"\n"
+         "log=\"$root/var/log/" +
+         (service.logName.empty() ? service.name + ".log" : service.logName) +
+         "\"\n"
          "\n"
          "# Running: the recorded process exists and is not a zombie left for its reaper.\n"
          "running() {\n"
-         "  [ -f \"$pidfile\" ] || return 1\n"
+         "  [ -s \"$pidfile\" ] || return 1\n"
          "  pid=$(cat \"$pidfile\")\n"
          "  kill -0 \"$pid\" 2>/dev/null && ! grep -q '^State:[[:space:]]*Z' \"/proc/$pid/status\" "
          "2>/dev/null\n"
          "}\n"
-         "note() { echo \"$(date '+%Y-%m-%d %H:%M:%S') fileindexd $*\" >> \"$root/var/log/services.log\"; }\n"
+         "note() { echo \"$(date '+%Y-%m-%d %H:%M:%S') " +
+         service.name +
+         " $*\" >> \"$root/var/log/services.log\"; }\n"
          "\n"
          "case \"$1\" in\n"
          "  status) running ;;\n"
          "  start)\n"
-         "    running && exit 0\n"
-         "    \"$probe\" --sysroot \"$root\" --output \"$root/var/log/fileindexd.log\" \\\n"
-         "      </dev/null >>\"$root/var/log/fileindexd.err\" 2>&1 &\n"
-         "    echo $! > \"$pidfile\"\n"
-         "    # Commands follow the start at once: wait until the socket is there.\n"
+         "    running && exit 0\n" +
+         (service.before.empty() ? "" : "    " + service.before + "\n") +
+         "    rm -f \"$pidfile\"\n"
+         "    " +
+         service.command +
+         " </dev/null >>\"$log\" 2>&1 &\n"
+         "    child=$!\n" +
+         (service.recordPid ? "    echo \"$child\" > \"$pidfile\"\n" : "") +
+         "    # Commands follow the start at once: wait until it is ready.\n"
          "    tries=0\n"
-         "    until [ -S \"$socket\" ]; do\n"
+         "    until " +
+         readyTest +
+         " && running; do\n"
          "      tries=$((tries + 1))\n"
-         "      if [ \"$tries\" -gt 300 ] || ! running; then note \"failed to start\"; exit 1; fi\n"
+         "      if [ \"$tries\" -gt 500 ] || ! kill -0 \"$child\" 2>/dev/null; then note \"failed to "
+         "start\"; exit 1; fi\n"
          "      sleep 0.01\n"
          "    done\n"
-         "    sleep 0.02\n"
          "    note \"started (pid $(cat \"$pidfile\"))\" ;;\n"
          "  stop)\n"
          "    if running; then\n"
          "      kill \"$pid\"\n"
+         "      # A clean stop commits the work in hand: give it time.\n"
          "      tries=0\n"
-         "      while running && [ \"$tries\" -lt 300 ]; do tries=$((tries + 1)); sleep 0.01; done\n"
+         "      while running && [ \"$tries\" -lt 1000 ]; do tries=$((tries + 1)); sleep 0.01; done\n"
+         "      running && kill -9 \"$pid\"\n"
          "      note \"stopped (pid $pid)\"\n"
-         "    fi\n"
-         "    rm -f \"$pidfile\" ;;\n"
+         "    fi\n" +
+         (service.after.empty() ? "" : "    " + service.after + "\n") +
+         "    exit 0 ;;\n"
          "  restart) \"$0\" stop && \"$0\" start ;;\n"
          "  *) echo \"usage: $0 status|start|stop|restart\" >&2; exit 2 ;;\n"
          "esac\n";
@@ -205,7 +244,7 @@ std::string Notifier(const std::string& root) {
          " >> \"$root/var/log/notify.log\"\n";
 }
 
-int Init(Session& s, const std::string& dir, const std::string& probeOption, bool force) {
+int Init(Session& s, const std::string& dir, bool useProbe, bool force) {
   if (!MakeDirs(dir)) {
     s.Fail("sandbox init", "cannot create " + dir + ": " + std::strerror(errno));
     return s.Finish(Json::Value(), nullptr);
@@ -216,9 +255,33 @@ int Init(Session& s, const std::string& dir, const std::string& probeOption, boo
     s.Fail("sandbox init", root + " already holds a sandbox (--force to write it again)");
     return s.Finish(Json::Value(), nullptr);
   }
-  const std::string probe = probeOption.empty() ? FindProbe() : Canonical(probeOption);
-  if (!IsExecutable(probe)) {
-    s.Fail("sandbox init", "fileindex-probe not found; build it or pass --probe PATH");
+  // The indexing daemon and the notification daemon, or the probe standing in for both.
+  std::vector<DaemonService> daemons;
+  std::string daemonProgram;
+  const std::string socket = root + "/var/run/fileindexd.sock";
+  if (useProbe) {
+    daemonProgram = FindProgram("fileindex-probe", FILEINDEXCTL_PROBE, "probe");
+    daemons.push_back(
+        {"fileindexd",
+         Quote(daemonProgram) + " --sysroot \"$root\" --output \"$root/var/log/fileindexd.log\"", socket, "",
+         "", true, "fileindexd.err"});
+  } else {
+    daemonProgram = FindProgram("fileindexd", FILEINDEXCTL_FILEINDEXD, "daemons/fileindexd");
+    const std::string notifier = FindProgram("tavotifyd", FILEINDEXCTL_TAVOTIFYD, "daemons/tavotifyd");
+    if (notifier.empty()) {
+      s.Fail("sandbox init", "tavotifyd not found; build it (or use --probe)");
+      return s.Finish(Json::Value(), nullptr);
+    }
+    daemons.push_back(
+        {"tavotifyd", Quote(notifier) + " --sysroot \"$root\" --foreground", "", "", "", false, ""});
+    // The notification daemon comes with the indexing daemon, as a dependency would.
+    const std::string hooks = root + "/etc/tavo/services/";
+    daemons.push_back({"fileindexd", Quote(daemonProgram) + " --sysroot \"$root\" --log-stderr", socket,
+                       Quote(hooks + "tavotifyd") + " start || exit 1", "", false, ""});
+  }
+  if (!IsExecutable(daemonProgram)) {
+    s.Fail("sandbox init", useProbe ? "fileindex-probe not found; build it"
+                                    : "fileindexd not found; build it (or use --probe)");
     return s.Finish(Json::Value(), nullptr);
   }
 
@@ -240,7 +303,8 @@ int Init(Session& s, const std::string& dir, const std::string& probeOption, boo
   builder["indentation"] = "  ";
   ok = ok && WriteFile(root + "/etc/tavo/shares.json", Json::writeString(builder, ShareTable()) + "\n");
   ok = ok && WriteFile(root + "/etc/samba/smb.conf", SambaConf());
-  ok = ok && WriteFile(root + "/etc/tavo/services/fileindexd", DaemonHook(root, probe), 0755);
+  for (const DaemonService& daemon : daemons)
+    ok = ok && WriteFile(root + "/etc/tavo/services/" + daemon.name, ServiceHook(root, daemon), 0755);
   ok = ok && WriteFile(root + "/etc/tavo/services/samba", SambaHook(root), 0755);
   ok = ok && WriteFile(root + "/usr/tavo/bin/tavovemnotify", Notifier(root), 0755);
   if (!ok) {
@@ -250,7 +314,8 @@ int Init(Session& s, const std::string& dir, const std::string& probeOption, boo
 
   Json::Value result;
   result["root"] = root;
-  result["probe"] = probe;
+  result["daemon"] = daemonProgram;
+  result["probe"] = useProbe;
   result["shares"] = ShareTable()["shares"];
   return s.Finish(result, [&]() {
     std::printf("sandbox ready in %s\n", root.c_str());
@@ -260,7 +325,8 @@ int Init(Session& s, const std::string& dir, const std::string& probeOption, boo
                     YesNo(layout.encrypted), YesNo(layout.recycleBin)});
     }
     table.Print(stdout);
-    std::printf("daemon probe: %s (started as the service fileindexd)\n", probe.c_str());
+    std::printf("%s: %s (started as the service fileindexd)\n", useProbe ? "daemon probe" : "indexing daemon",
+                daemonProgram.c_str());
     std::printf("use it with:  fileindexctl --sysroot %s ...   or   export FILEINDEX_SYSROOT=%s\n",
                 root.c_str(), root.c_str());
   });
@@ -316,14 +382,16 @@ void AddSandboxCommands(CLI::App& app, Action& action) {
 
   struct InitArgs {
     std::string dir;
-    std::string probe;
+    bool probe = false;
     bool force = false;
   };
   auto init = std::make_shared<InitArgs>();
   CLI::App* cmd = sandbox->add_subcommand(
       "init", "Create a system root: shares on two volumes, share table, Samba configuration, service hooks");
   cmd->add_option("dir", init->dir, "Directory of the new system root")->required();
-  cmd->add_option("--probe", init->probe, "The fileindex-probe program to start as the daemon");
+  cmd->add_flag(
+      "--probe", init->probe,
+      "Let the daemon probe stand in for the daemons: it logs each command to var/log/fileindexd.log");
   cmd->add_flag("--force", init->force, "Write over an existing sandbox");
   cmd->callback([&action, init]() {
     action = [init](Session& s) { return Init(s, init->dir, init->probe, init->force); };
@@ -338,10 +406,13 @@ void AddSandboxCommands(CLI::App& app, Action& action) {
     action = [names](Session& s) { return RenameShare(s, names->first, names->second); };
   });
 
-  cmd = sandbox->add_subcommand("stop", "Stop the sandbox's daemon probe (the fileindexd service)");
+  cmd = sandbox->add_subcommand("stop", "Stop the sandbox's daemons (the fileindexd and tavotifyd services)");
   cmd->callback([&action]() {
     action = [](Session& s) {
       s.Call("VLIBServiceStop", []() { return VLIBServiceStop("fileindexd", 1) >= 0; });
+      const std::string notifierHook = Canonical(s.options().sysroot) + "/etc/tavo/services/tavotifyd";
+      if (::access(notifierHook.c_str(), F_OK) == 0)
+        s.Call("VLIBServiceStop", []() { return VLIBServiceStop("tavotifyd", 1) >= 0; });
       Json::Value result;
       result["stopped"] = "fileindexd";
       return s.Finish(result, []() { std::printf("fileindexd stopped\n"); });
