@@ -1,5 +1,6 @@
 // Every public operation of the library as a command.
 #include "commands.h"
+#include "index_view.h"
 
 #include <fileindex/fileindex.h>
 #include <tavo/platform.h>
@@ -280,6 +281,7 @@ void AddStatusCommands(CLI::App& app, Action& action) {
           }
         }
         result["folders"] = Json::Value(Json::arrayValue);
+        const IndexFigures figures = CollectIndexFigures();
         for (const std::string& path : folders) {
           Json::Value item;
           item["path"] = path;
@@ -287,15 +289,19 @@ void AddStatusCommands(CLI::App& app, Action& action) {
             item["status"] = FI::StatusMgr::GetFolderStatus(path);
             return true;
           });
+          AddFolderFigures(figures, path, item);
           result["folders"].append(item);
         }
+        result["shares"] = ShareFiguresJson(figures);
         return s.Finish(result, [&]() {
           std::printf("indexing: %s\n", result["status"].asString().c_str());
           std::printf("pause:    %s\n", DescribePause(resume, now).c_str());
           if (result["folders"].size() == 0) return;
-          Table table({"FOLDER", "STATUS"});
+          PrintShareFigures(result["shares"]);
+          Table table({"FOLDER", "STATUS", "INDEXED", "PENDING"});
           for (const Json::Value& item : result["folders"])
-            table.AddRow({item["path"].asString(), item["status"].asString()});
+            table.AddRow({item["path"].asString(), item["status"].asString(), FigureText(item["indexed"]),
+                          FigureText(item["pending"])});
           std::printf("\n");
           table.Print(stdout);
         });

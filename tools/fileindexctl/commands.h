@@ -18,6 +18,7 @@ void AddShareCommands(CLI::App& app, Action& action);
 void AddPathCommands(CLI::App& app, Action& action);
 void AddMiscCommands(CLI::App& app, Action& action);
 void AddSandboxCommands(CLI::App& app, Action& action);
+void AddSearchCommand(CLI::App& app, Action& action);
 
 }  // namespace fileindexctl
 

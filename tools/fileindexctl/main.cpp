@@ -29,6 +29,7 @@ int main(int argc, char** argv) {
   fileindexctl::AddPathCommands(app, action);
   fileindexctl::AddMiscCommands(app, action);
   fileindexctl::AddSandboxCommands(app, action);
+  fileindexctl::AddSearchCommand(app, action);
 
   try {
     app.parse(argc, argv);

@@ -1,0 +1,120 @@
+// `fileindexctl search`: the files the indexing service has indexed, by words of their names.
+#include <fileindex/index_mgr.h>
+#include <unistd.h>
+
+#include <ctime>
+#include <memory>
+
+#include "commands.h"
+#include "index_view.h"
+#include "output.h"
+
+namespace fileindexctl {
+
+namespace {
+
+namespace FI = TAVO::FILEINDEX;
+
+struct SearchArgs {
+  std::vector<std::string> words;
+  std::string share;
+  std::string kind;
+  std::size_t limit = 50;
+};
+
+std::string HumanSize(std::int64_t bytes) {
+  const char* units[] = {"B", "KiB", "MiB", "GiB", "TiB"};
+  double value = static_cast<double>(bytes);
+  int unit = 0;
+  while (value >= 1024 && unit < 4) {
+    value /= 1024;
+    ++unit;
+  }
+  char text[32];
+  std::snprintf(text, sizeof(text), unit == 0 ? "%.0f %s" : "%.1f %s", value, units[unit]);
+  return text;
+}
+
+int Search(Session& s, const SearchArgs& args) {
+  // File names are private to those who may read the files: only root searches here;
+  // users search through Samba, which checks every hit against their own permissions.
+  if (::geteuid() != 0) {
+    s.Fail("search", "only root may search the index (users search their shares through Samba)");
+    return s.Finish(Json::Value(), nullptr);
+  }
+  fileindex_store::Query query;
+  query.words = args.words;
+  query.limit = args.limit;
+  if (!args.kind.empty()) {
+    query.anyKind = false;
+    if (!fileindex_store::KindFromName(args.kind, query.kind) ||
+        query.kind == fileindex_store::Kind::kOther) {
+      s.Fail("search", "--kind must be document, audio, video or photo, not \"" + args.kind + "\"");
+      return s.Finish(Json::Value(), nullptr);
+    }
+  }
+  std::vector<FI::Folder> folders;
+  if (!s.Call("IndexMgr::List", [&]() { return FI::IndexMgr::List(folders); }))
+    return s.Finish(Json::Value(), nullptr);
+  std::map<std::string, IndexedShare> shares = IndexedShares(folders);
+  if (!args.share.empty()) {
+    auto it = shares.find(args.share);
+    if (it == shares.end()) {
+      s.Fail("search", "share \"" + args.share + "\" has no indexed folder");
+      return s.Finish(Json::Value(), nullptr);
+    }
+    shares = {*it};
+  }
+  std::vector<SearchHit> hits;
+  std::map<std::string, std::string> unavailable;
+  SearchShares(shares, query, hits, unavailable);
+
+  Json::Value result(Json::objectValue);
+  result["hits"] = Json::Value(Json::arrayValue);
+  for (const SearchHit& found : hits) {
+    Json::Value item;
+    item["path"] = found.path;
+    item["share"] = found.share;
+    item["type"] = found.hit.isDir ? "directory" : "file";
+    item["kind"] = found.hit.isDir ? "" : fileindex_store::KindName(found.hit.kind);
+    item["size"] = static_cast<Json::Int64>(found.hit.size);
+    item["mtime"] = static_cast<Json::Int64>(found.hit.mtime);
+    result["hits"].append(item);
+  }
+  result["count"] = static_cast<Json::UInt64>(hits.size());
+  for (const auto& share : unavailable) result["unavailable"][share.first] = share.second;
+  return s.Finish(result, [&]() {
+    for (const auto& share : unavailable)
+      std::fprintf(stderr, "fileindexctl: share %s not searched: no index yet (%s)\n", share.first.c_str(),
+                   share.second.c_str());
+    if (hits.empty()) {
+      std::printf("no match\n");
+      return;
+    }
+    Table table({"PATH", "KIND", "SIZE", "MODIFIED"});
+    for (const SearchHit& found : hits) {
+      table.AddRow({found.path + (found.hit.isDir ? "/" : ""),
+                    found.hit.isDir ? "directory" : fileindex_store::KindName(found.hit.kind),
+                    found.hit.isDir ? "" : HumanSize(found.hit.size), LocalTime(found.hit.mtime)});
+    }
+    table.Print(stdout);
+  });
+}
+
+}  // namespace
+
+void AddSearchCommand(CLI::App& app, Action& action) {
+  auto args = std::make_shared<SearchArgs>();
+  CLI::App* cmd = app.add_subcommand(
+      "search",
+      "Indexed files and directories whose names hold every word (as the start of a word), newest first");
+  cmd->add_option("words", args->words, "Words to look for (case-insensitive, accents ignored)")->required();
+  cmd->add_option("--share", args->share, "Only this share");
+  cmd->add_option("--kind", args->kind, "Only files of this kind: document, audio, video or photo");
+  cmd->add_option("--limit", args->limit, "At most this many results")
+      ->capture_default_str()
+      ->check(CLI::Range(1, 100000));
+  cmd->callback([&action, args]() { action = [args](Session& s) { return Search(s, *args); }; });
+}
+
+}  // namespace fileindexctl
