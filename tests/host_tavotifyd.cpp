@@ -1,0 +1,272 @@
+// tavotifyd end to end: the real binary over a temporary system root, watch lists written by
+// the host platform's MonitorQueue, and the queue read back with the consumers' line parser.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <tavo/tavotifyd.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <climits>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "queue_events.h"
+
+namespace fs = std::filesystem;
+using fileindex_queue::QueueEvent;
+
+namespace {
+const std::string kDaemon = FILEINDEX_BINARY_DIR "/daemons/tavotifyd/tavotifyd";
+const int kMask = 65486;
+
+std::string ReadFile(const std::string& path) {
+  std::stringstream text;
+  text << std::ifstream(path).rdbuf();
+  return text.str();
+}
+void WriteFile(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+bool WaitUntil(const std::function<bool()>& done, int millis = 3000) {
+  for (int waited = 0; waited < millis; waited += 10) {
+    if (done()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return done();
+}
+
+class TavotifydTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/host_tavotifyd.XXXXXX";
+    ASSERT_NE(::mkdtemp(pattern), nullptr);
+    char resolved[PATH_MAX];
+    ASSERT_NE(::realpath(pattern, resolved), nullptr);
+    root_ = resolved;
+    share_ = root_ + "/volume1/share";
+    queue_ = share_ + "/@eaDir/TAVO@file_index_queue";
+    ::setenv("FILEINDEX_SYSROOT", root_.c_str(), 1);  // where MonitorQueue writes the lists
+    for (const char* dir : {"/var/run", "/volume1/share/@eaDir", "/volume1/share/docs", "/outside"})
+      fs::create_directories(root_ + dir);
+  }
+  void TearDown() override {
+    if (pid_ > 0) {
+      ::kill(pid_, SIGKILL);
+      ::waitpid(pid_, nullptr, 0);
+    }
+    ::unsetenv("FILEINDEX_SYSROOT");
+    fs::remove_all(root_);
+  }
+  // The list of queue_ through the platform's own writer; an empty folders list watches nothing.
+  void SetList(const std::vector<std::string>& folders) {
+    Json::Value config(Json::objectValue);
+    config["queue"] = queue_;
+    config["config"] = Json::Value(Json::arrayValue);
+    for (const std::string& folder : folders) {
+      Json::Value entry;
+      entry["path"] = folder;
+      entry["mask"] = kMask;
+      entry["ignore"].append("@eaDir");
+      config["config"].append(entry);
+    }
+    ASSERT_EQ(TAVO::TAVOTIFYD::MonitorQueue::Upsert(TAVO::TAVOTIFYD::MonitorQueue(config), "fileindex",
+                                                    TAVO::TAVOTIFYD::MONITOR_QUEUE_TYPE_FILE),
+              1);
+  }
+  // Runs the daemon (through `wrapper`, a command that ends by exec'ing its arguments) as
+  // this process's child pid_, and waits until it watches.
+  void Start(const std::string& wrapper = "") {
+    pid_ = ::fork();
+    ASSERT_GE(pid_, 0);
+    if (pid_ == 0) {
+      int log = ::open((root_ + "/daemon.log").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
+      ::dup2(log, 1);
+      ::dup2(log, 2);
+      const std::string command = "exec " + wrapper + " \"$0\" --sysroot \"$1\" --foreground";
+      ::execl("/bin/sh", "sh", "-c", command.c_str(), kDaemon.c_str(), root_.c_str(), nullptr);
+      ::_exit(127);
+    }
+    ASSERT_TRUE(WaitUntil([&] { return Log().find("started:") != std::string::npos; }, 10000)) << Log();
+  }
+  int Stop() {
+    ::kill(pid_, SIGTERM);
+    int status = -1;
+    bool exited = WaitUntil([&] { return ::waitpid(pid_, &status, WNOHANG) == pid_; }, 5000);
+    EXPECT_TRUE(exited) << "no exit within 5 s of SIGTERM";
+    if (exited) pid_ = -1;
+    return exited && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  }
+  std::string Log() { return ReadFile(root_ + "/daemon.log"); }
+  std::vector<QueueEvent> Events() {
+    std::vector<QueueEvent> events;
+    std::istringstream lines(ReadFile(queue_));
+    for (std::string line; std::getline(lines, line);) {
+      EXPECT_TRUE(fileindex_queue::ParseQueueLine(line.data(), line.size(), events.emplace_back())) << line;
+    }
+    return events;
+  }
+  size_t Count(std::uint32_t code, const std::string& path, const std::string& pathOld = "") {
+    size_t count = 0;
+    for (const QueueEvent& event : Events())
+      count += event.code == code && event.path == path && event.pathOld == pathOld;
+    return count;
+  }
+  bool WaitFor(std::uint32_t code, const std::string& path, const std::string& pathOld = "",
+               int millis = 3000) {
+    return WaitUntil([&] { return Count(code, path, pathOld) > 0; }, millis);
+  }
+
+  std::string root_, share_, queue_;
+  pid_t pid_ = -1;
+};
+
+// Files created, written, changed and removed; IN_MODIFY is not a line; "@eaDir" is neither
+// watched nor reported; a single instance, and SIGTERM stops it cleanly.
+TEST_F(TavotifydTest, ReportsFileEventsOnceAndSkipsIgnoredNames) {
+  SetList({share_});
+  Start();
+  EXPECT_EQ(ReadFile(root_ + "/var/run/tavotifyd.pid"), std::to_string(pid_) + "\n");
+  int second = std::system((kDaemon + " --sysroot " + root_ + " 2>" + root_ + "/second.err").c_str());
+  EXPECT_EQ(WEXITSTATUS(second), 1);
+  EXPECT_NE(ReadFile(root_ + "/second.err").find("already running (pid " + std::to_string(pid_) + ")"),
+            std::string::npos);
+
+  const std::string file = share_ + "/docs/a.txt";
+  {
+    std::ofstream out(file);
+    for (int i = 0; i < 3; ++i) out << std::string(100000, 'x') << std::flush;  // several write()s
+  }
+  fs::create_directories(share_ + "/docs/@eaDir/inner");
+  WriteFile(share_ + "/docs/@eaDir/inner/thumb", "x");
+  WriteFile(share_ + "/@eaDir/other", "x");
+  ASSERT_EQ(::chmod(file.c_str(), 0600), 0);
+  ASSERT_EQ(::unlink(file.c_str()), 0);
+  ASSERT_TRUE(WaitFor(fileindex_queue::kDeleted, file)) << ReadFile(queue_);
+  EXPECT_EQ(Count(fileindex_queue::kCreated, file), 1u);
+  EXPECT_EQ(Count(fileindex_queue::kModified, file), 1u);
+  EXPECT_EQ(Count(fileindex_queue::kAttributes, file), 1u);
+  EXPECT_EQ(Count(fileindex_queue::kDeleted, file), 1u);
+  EXPECT_EQ(ReadFile(queue_).find("@eaDir"), std::string::npos) << ReadFile(queue_);
+  EXPECT_EQ(Stop(), 0);
+  EXPECT_NE(Log().find("stopped"), std::string::npos) << Log();
+}
+
+// A rename is one line; directories renamed or moved in keep being followed under their new
+// paths, a tree moved in is reported entry by entry, and a move out is a deletion.
+TEST_F(TavotifydTest, RenamesAndMovedTrees) {
+  fs::create_directories(share_ + "/docs/sub/deep");
+  fs::create_directories(root_ + "/outside/tree/deep");
+  WriteFile(root_ + "/outside/tree/deep/b", "b");
+  SetList({share_});
+  Start();
+
+  WriteFile(share_ + "/docs/old.txt", "x");
+  fs::rename(share_ + "/docs/old.txt", share_ + "/docs/new.txt");
+  fs::rename(share_ + "/docs/sub", share_ + "/moved");
+  fs::rename(root_ + "/outside/tree", share_ + "/tree");
+  ASSERT_TRUE(WaitFor(fileindex_queue::kCreated, share_ + "/tree/deep/b")) << ReadFile(queue_);
+  WriteFile(share_ + "/moved/deep/c", "c");
+  WriteFile(share_ + "/tree/deep/d", "d");
+  fs::rename(share_ + "/docs/new.txt", root_ + "/outside/new.txt");
+  ASSERT_TRUE(WaitFor(fileindex_queue::kDeleted, share_ + "/docs/new.txt")) << ReadFile(queue_);
+
+  EXPECT_EQ(Count(fileindex_queue::kRenamed, share_ + "/docs/new.txt", share_ + "/docs/old.txt"), 1u);
+  EXPECT_EQ(Count(fileindex_queue::kDeleted, share_ + "/docs/old.txt"), 0u);
+  EXPECT_EQ(Count(fileindex_queue::kRenamed, share_ + "/moved", share_ + "/docs/sub"), 1u);
+  for (const char* path : {"/tree", "/tree/deep", "/tree/deep/b", "/moved/deep/c", "/tree/deep/d"})
+    EXPECT_GE(Count(fileindex_queue::kCreated, share_ + path), 1u) << path << "\n" << ReadFile(queue_);
+  EXPECT_EQ(ReadFile(queue_).find(share_ + "/docs/sub/deep/c"), std::string::npos) << "stale path";
+}
+
+// Lists added, changed (a nested folder: still one line per event) and removed while running
+// take effect within a second.
+TEST_F(TavotifydTest, FollowsWatchListChanges) {
+  fs::create_directories(root_ + "/volume1/second");
+  Start();
+  SetList({share_});
+  std::this_thread::sleep_for(std::chrono::seconds(1));
+  WriteFile(share_ + "/docs/one", "1");
+  EXPECT_TRUE(WaitFor(fileindex_queue::kCreated, share_ + "/docs/one")) << Log();
+
+  SetList({share_, share_ + "/docs", root_ + "/volume1/second"});
+  std::this_thread::sleep_for(std::chrono::seconds(1));
+  WriteFile(root_ + "/volume1/second/two", "2");
+  WriteFile(share_ + "/docs/three", "3");
+  EXPECT_TRUE(WaitFor(fileindex_queue::kCreated, root_ + "/volume1/second/two")) << Log();
+  EXPECT_TRUE(WaitFor(fileindex_queue::kModified, share_ + "/docs/three"));
+  EXPECT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/three"), 1u);
+
+  ASSERT_EQ(
+      TAVO::TAVOTIFYD::MonitorQueue::Delete(queue_, "fileindex", TAVO::TAVOTIFYD::MONITOR_QUEUE_TYPE_FILE),
+      1);
+  std::this_thread::sleep_for(std::chrono::seconds(1));
+  WriteFile(share_ + "/docs/four", "4");
+  EXPECT_FALSE(WaitFor(fileindex_queue::kCreated, share_ + "/docs/four", "", 500)) << "still watched";
+}
+
+// While another holder keeps the queue locked nothing is written, and once it lets go every
+// line arrives, once.
+TEST_F(TavotifydTest, HeldQueueLockDelaysButLosesNothing) {
+  SetList({share_});
+  Start();
+  int lock = ::open(queue_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+  ASSERT_GE(lock, 0);
+  ASSERT_EQ(::flock(lock, LOCK_EX), 0);
+  const int kFiles = 200;
+  for (int i = 0; i < kFiles; ++i) WriteFile(share_ + "/docs/f" + std::to_string(i), "x");
+  std::this_thread::sleep_for(std::chrono::milliseconds(700));
+  EXPECT_EQ(ReadFile(queue_), "");
+  ::close(lock);
+  ASSERT_TRUE(WaitFor(fileindex_queue::kModified, share_ + "/docs/f" + std::to_string(kFiles - 1)));
+  for (int i = 0; i < kFiles; ++i) {
+    ASSERT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/f" + std::to_string(i)), 1u) << i;
+    ASSERT_EQ(Count(fileindex_queue::kModified, share_ + "/docs/f" + std::to_string(i)), 1u) << i;
+  }
+}
+
+// Lost events (the kernel's event queue overflowed while the daemon was stopped) ask for a
+// reindex of the folder, and the daemon goes on watching.
+TEST_F(TavotifydTest, QueueOverflowAsksForReindex) {
+  const int maxQueued = std::atoi(ReadFile("/proc/sys/fs/inotify/max_queued_events").c_str());
+  if (maxQueued <= 0 || maxQueued > 200000) GTEST_SKIP() << "max_queued_events is " << maxQueued;
+  SetList({share_});
+  Start();
+  ASSERT_EQ(::kill(pid_, SIGSTOP), 0);
+  // Two events a file (created, closed after writing).
+  for (int i = 0; i < maxQueued / 2 + 1000; ++i) {
+    int fd = ::open((share_ + "/docs/n" + std::to_string(i)).c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+    ASSERT_GE(fd, 0);
+    ::close(fd);
+  }
+  ASSERT_EQ(::kill(pid_, SIGCONT), 0);
+  EXPECT_TRUE(WaitFor(fileindex_queue::kReindex, share_, "", 10000)) << Log();
+  EXPECT_NE(Log().find("max_queued_events"), std::string::npos) << Log();
+  WriteFile(share_ + "/docs/after", "x");
+  EXPECT_TRUE(WaitFor(fileindex_queue::kCreated, share_ + "/docs/after"));
+}
+
+// Directories beyond the per-user watch limit (lowered in a user namespace of its own) are
+// logged with the setting to raise and ask for a reindex of their folder.
+TEST_F(TavotifydTest, WatchLimitAsksForReindex) {
+  const std::string setLimit = "echo 7 >/proc/sys/user/max_inotify_watches";
+  if (std::system(("unshare -U -r sh -c '" + setLimit + "' 2>/dev/null").c_str()) != 0)
+    GTEST_SKIP() << "cannot lower the inotify watch limit in a user namespace here";
+  for (int i = 0; i < 6; ++i) fs::create_directories(share_ + "/docs/d" + std::to_string(i));
+  SetList({share_});
+  // The list tree takes 5 watches (run/tavotifyd down to the list's directory), the folder
+  // would take 8.
+  Start("unshare -U -r sh -c '" + setLimit + " && exec \"$0\" \"$@\"'");
+  EXPECT_TRUE(WaitFor(fileindex_queue::kReindex, share_)) << Log();
+  EXPECT_NE(Log().find("fs.inotify.max_user_watches"), std::string::npos) << Log();
+  EXPECT_EQ(Stop(), 0);
+}
+
+}  // namespace
