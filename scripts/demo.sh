@@ -1,9 +1,10 @@
 #!/usr/bin/env bash
-# A guided tour of fileindexctl on this machine: installs the build dependencies, builds
-# the library, the host platform, the CLI and the daemon probe (Release, in build-demo),
-# creates a sandbox system root in a temporary directory and drives the library through
-# it, showing after each step what reached the daemon (the probe's log), the per-share
-# event queues and the notification daemon's watch lists.
+# A guided tour of the file-indexing service on this machine: installs the build
+# dependencies, builds the library, the host platform, fileindexctl and the two daemons
+# (Release, in build-demo), creates a sandbox system root in a temporary directory with a
+# few hundred files, and drives the whole loop through fileindexctl: folders added and
+# crawled, files found, created, renamed, a file type switched off, indexing paused and
+# resumed, a folder removed.
 #
 #   bash scripts/demo.sh            (KEEP_SANDBOX=1 keeps the sandbox afterwards)
 set -euo pipefail
@@ -12,7 +13,7 @@ cd "$(dirname "$0")/.."
 bash scripts/install-deps.sh
 BUILD_DIR=${BUILD_DIR:-build-demo}
 cmake -S . -B "$BUILD_DIR" -DCMAKE_BUILD_TYPE=Release -DFILEINDEX_TESTS=OFF >/dev/null
-cmake --build "$BUILD_DIR" -j"$(nproc)" --target fileindexctl fileindex-probe >/dev/null
+cmake --build "$BUILD_DIR" -j"$(nproc)" --target fileindexctl fileindexd tavotifyd fileindex-probe >/dev/null
 CTL="$PWD/$BUILD_DIR/tools/fileindexctl/fileindexctl"
 
 SANDBOX=$(mktemp -d /tmp/fileindex-demo.XXXXXX)
@@ -23,9 +24,6 @@ cleanup() {
 trap cleanup EXIT
 
 if [ -t 1 ]; then BOLD=$'\e[1m' DIM=$'\e[2m' OFF=$'\e[0m'; else BOLD='' DIM='' OFF=''; fi
-DAEMON_LOG="$SANDBOX/var/log/fileindexd.log"
-seen=0
-
 step() { printf '\n%s== %s%s\n' "$BOLD" "$*" "$OFF"; }
 say() { printf '%s# %s%s\n' "$DIM" "$*" "$OFF"; }
 # One fileindexctl command, shown as typed; a failure is shown, not fatal.
@@ -35,125 +33,113 @@ ctl() {
   "$CTL" --sysroot "$SANDBOX" --no-syslog "$@" 2>&1 || status=$?
   if [ "$status" -ne 0 ]; then printf '(exit status %d)\n' "$status"; fi
 }
-# The commands the daemon received since the last look.
-daemon() {
-  sleep 0.1  # the probe writes its line once it has read the whole frame
-  local total=0
-  [ -f "$DAEMON_LOG" ] && total=$(wc -l < "$DAEMON_LOG")
-  if [ "$total" -gt "$seen" ]; then
-    echo "daemon received:"
-    tail -n +"$((seen + 1))" "$DAEMON_LOG" | sed 's/^/  /'
-  else
-    echo "daemon received: nothing"
-  fi
-  seen=$total
+now_ms() { date +%s%3N; }
+# Waits (at most 20 s) until the service reports the expected overall status.
+wait_status() {
+  local want=$1 start status
+  start=$(now_ms)
+  for _ in $(seq 400); do
+    status=$("$CTL" --sysroot "$SANDBOX" --no-syslog --json status |
+             python3 -c 'import json, sys; print(json.load(sys.stdin).get("status", ""))' 2>/dev/null || true)
+    [ "$status" = "$want" ] && { say "status \"$want\" after $(($(now_ms) - start)) ms"; return 0; }
+    sleep 0.05
+  done
+  say "status still \"$status\" after 20 s"
 }
-queues() {
-  local found=0 file
-  while IFS= read -r file; do
-    found=1
-    echo "queue ${file#"$SANDBOX"}:"
-    sed 's/^/  /' "$file"
-  done < <(find "$SANDBOX"/volume* -path '*/@eaDir/TAVO@file_index_queue*' -type f 2>/dev/null | sort)
-  [ "$found" -eq 1 ] || echo "queues: none"
+# Waits (at most 5 s) until a search for the words finds (or no longer finds) the path.
+wait_search() {
+  local mode=$1 path=$2 start
+  shift 2
+  start=$(now_ms)
+  for _ in $(seq 250); do
+    if "$CTL" --sysroot "$SANDBOX" --no-syslog search "$@" 2>/dev/null | grep -qF "$path"; then
+      [ "$mode" = found ] && { say "$path found $(($(now_ms) - start)) ms after the change"; return 0; }
+    else
+      [ "$mode" = gone ] && { say "$path gone $(($(now_ms) - start)) ms after the change"; return 0; }
+    fi
+    sleep 0.02
+  done
+  say "$path still not $mode after 5 s"
 }
-watches() {
-  local found=0 file
-  while IFS= read -r file; do
-    found=1
-    echo "watch list ${file#"$SANDBOX"}:"
-    sed 's/^/  /' "$file"
-  done < <(find "$SANDBOX/run/tavotifyd" -name '*.json' -type f 2>/dev/null | sort)
-  [ "$found" -eq 1 ] || echo "watch lists: none"
-}
-services() {
-  echo "fileindexd: $(cat "$SANDBOX/run/tavo/service/fileindexd" 2>/dev/null || echo never started)," \
-       "Samba spotlight: $(sed -n 's/^[[:space:]]*spotlight = //p' "$SANDBOX/etc/samba/smb.conf" | head -1)"
-  [ -f "$SANDBOX/var/log/services.log" ] && sed 's/^/  services.log: /' "$SANDBOX/var/log/services.log"
-  : > "$SANDBOX/var/log/services.log"
+log_tail() {
+  say "fileindexd's log (last lines):"
+  tail -n "${1:-4}" "$SANDBOX/var/log/fileindexd.log" | sed 's/^/  /'
 }
 
 step "A sandbox: two volumes, five shares, a share table, smb.conf and service hooks"
 ctl sandbox init "$SANDBOX"
-say "share directories and a few files (photo/latest is a symbolic link to 2020):"
-(cd "$SANDBOX" && find volume1/photo volume1/video -mindepth 1 | sort | sed 's/^/  /')
+say "and a few hundred files to find:"
+words=(beach mountain city harbour forest sunset river garden bridge market)
+for year in 2019 2020; do
+  for i in $(seq 0 79); do
+    w=${words[$((i % 10))]}
+    : > "$SANDBOX/volume1/photo/$year/${w}_$year-$i.jpg"
+  done
+  mkdir -p "$SANDBOX/volume1/photo/$year/notes"
+  for i in $(seq 0 19); do echo "note $i" > "$SANDBOX/volume1/photo/$year/notes/${words[$((i % 10))]} notes $i.txt"; done
+done
+for i in $(seq 0 59); do : > "$SANDBOX/volume1/video/movies/${words[$((i % 10))]} trip $i.mkv"; done
+mkdir -p "$SANDBOX/volume2/music/albums/Café del Mar"
+for i in $(seq 0 39); do : > "$SANDBOX/volume2/music/albums/Café del Mar/track $i ${words[$((i % 10))]}.flac"; done
+say "$(find "$SANDBOX"/volume* -type f | wc -l) files in the shares"
 
-step "Add folders in two shares"
-ctl folders add /photo/2019 /photo/2020
+step "Add folders: the library starts fileindexd (and the notification daemon), which crawls them"
+ctl folders add /photo/2019 /photo/2020 --photo --document
 ctl folders add /video/movies --video --name Movies
-say "the first add started fileindexd (the probe) and switched Samba's Spotlight on:"
-services
-daemon
-queues
-watches
-
-step "List them with their status"
-ctl folders list --additional status,is_valid
-ctl folders list --sort-by name --direction DESC --limit 2
+ctl folders add /music/albums --audio
+wait_status finished
 ctl status
 
-step "Check a few paths"
-ctl path indexed /photo/2019/beach.jpg
-ctl path can-index /photo/2019
-say "the recycle bin at the top of a share is never indexed:"
-ctl path can-index '/photo/#recycle'
-ctl path skip "$SANDBOX/volume1/photo/#recycle/deleted.jpg"
-say "nor is a path through a symbolic link, nor a read-only or encrypted share:"
-ctl path can-index /photo/latest
-ctl path indexed /photo/latest/city.jpg
-ctl path can-index /docs/manuals
-ctl share can-index vault
-ctl path queue photo
+step "Search: every word must begin a word of the name; case and accents do not matter"
+ctl search beach 2019 --limit 5
+ctl search CAFE
+ctl search track BEACH --limit 3
+ctl search --kind video sunset --limit 3
+ctl search notes --share photo --limit 3
 
-step "Pause for 2 hours, then resume"
-ctl pause 2
-ctl status
-daemon
-ctl resume
-daemon
+step "A new file is found within moments"
+: > "$SANDBOX/volume1/photo/2020/lighthouse.jpg"
+wait_search found /photo/2020/lighthouse.jpg lighthouse
+ctl search lighthouse
 
-step "Reindex a folder (a second request is absorbed by the pending one)"
-ctl reindex /photo/2019
-ctl reindex /photo/2019
-queues
+step "Rename it: the old name is gone, the new one found"
+mv "$SANDBOX/volume1/photo/2020/lighthouse.jpg" "$SANDBOX/volume1/photo/2020/old-lighthouse.jpg"
+wait_search found /photo/2020/old-lighthouse.jpg old lighthouse
+ctl search lighthouse
+log_tail 3
 
-step "A share runs out of space: the administrators are notified once"
-ctl share flags photo --no-space set
-sed 's/^/  notify.log: /' "$SANDBOX/var/log/notify.log"
+step "Switch the photo flag of /photo/2019 off: its photos leave the index (its notes stay)"
+ctl folders set /photo/2019 --no-photo
+wait_search gone /photo/2019/beach_2019-0.jpg beach 2019
+ctl search 2019 --limit 4
+wait_status finished
 ctl status /photo/2019
-ctl share revive photo
-daemon
 
-step "Rename a share: pause it, rename it on the appliance, move its folders, resume it"
-ctl share pause video
-daemon
-watches
-ctl sandbox rename-share video films
-ctl share rename video films
-ctl share resume films
-daemon
-watches
-ctl folders list
+step "Pause: status \"paused\", and a new file waits"
+ctl pause 1
+: > "$SANDBOX/volume1/photo/2020/paused-picture.jpg"
+sleep 1
+ctl status /photo/2020
+ctl search paused picture
+step "Resume: the waiting work is done"
+ctl resume
+wait_search found /photo/2020/paused-picture.jpg paused picture
+ctl search paused picture
 
-step "Remove folders until the daemon is stopped"
-ctl folders remove /photo/2020
-daemon
-queues
-ctl folders remove /photo/2019
-say "photo has no folder left: its queue and watch list are gone"
-daemon
-queues
-watches
-ctl folders remove /films/movies
-say "no folder left at all: fileindexd stopped, Spotlight off, Samba restarted"
-services
-daemon
-queues
-watches
+step "Remove a folder: its files are gone from search"
+ctl folders remove /video/movies
+wait_search gone "/video/movies/sunset trip 6.mkv" sunset trip
+ctl search trip --limit 3
+wait_status finished
 ctl status
+
+step "The rules still decide what may be indexed"
+ctl path can-index '/photo/#recycle'
+ctl path can-index /photo/latest
+ctl share can-index vault
 
 step "Failures name their error code and show the library's log lines"
-ctl folders get /photo/2019
+ctl folders get /photo/nowhere
 ctl folders add /nowhere/x
 
-printf '\n%sDone.%s The probe is stopped and the sandbox removed on exit.\n' "$BOLD" "$OFF"
+printf '\n%sDone.%s The daemons are stopped and the sandbox removed on exit.\n' "$BOLD" "$OFF"

@@ -4,7 +4,8 @@
 set -euo pipefail
 packages=(cmake make g++ pkg-config libjsoncpp-dev libicu-dev libgtest-dev libgmock-dev
           libbenchmark-dev libcli11-dev python3 abigail-tools
-          clang-14 libclang-rt-14-dev)
+          clang-14 libclang-rt-14-dev
+          libsqlite3-dev sqlite3 libsystemd-dev util-linux procps)
 missing=()
 for p in "${packages[@]}"; do
   dpkg -s "$p" >/dev/null 2>&1 || missing+=("$p")

@@ -46,7 +46,7 @@ class CliTest : public ::testing::Test {
     ASSERT_NE(::mkdtemp(pattern), nullptr);
     work_ = pattern;
     root_ = work_ + "/root";
-    ASSERT_EQ(Run({"sandbox", "init", root_}, false).status, 0);
+    ASSERT_EQ(Run({"sandbox", "init", root_, "--probe"}, false).status, 0);
     root_ = fs::canonical(root_).string();
   }
   void TearDown() override {
