@@ -1,0 +1,127 @@
+// The per-share index store: entries kept per directory, subtrees removed on whole path
+// components, and name searches by word prefix, case and accents ignored, newest first.
+#include <gtest/gtest.h>
+#include <store.h>
+#include <sys/stat.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <set>
+
+namespace fs = std::filesystem;
+using namespace fileindex_store;
+
+namespace {
+
+class IndexStoreTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/index_store.XXXXXX";
+    ASSERT_NE(::mkdtemp(pattern), nullptr);
+    dir_ = pattern;
+    std::string error;
+    writer_ = IndexWriter::Open(dir_ + "/db", error);
+    ASSERT_TRUE(writer_) << error;
+  }
+  void TearDown() override {
+    writer_.reset();
+    fs::remove_all(dir_);
+  }
+  void Put(const std::string& parent, const std::string& name, std::int64_t mtime = 1, bool isDir = false) {
+    Entry entry;
+    entry.parent = parent;
+    entry.name = name;
+    entry.isDir = isDir;
+    entry.mtime = mtime;
+    entry.kind = isDir ? Kind::kOther : KindOfExtension(ExtensionOf(name));
+    entry.folder = "f";
+    ASSERT_TRUE(writer_->Put(entry)) << writer_->LastError();
+  }
+  std::set<std::string> All() {
+    std::set<std::string> paths;
+    std::vector<Hit> hits;
+    Query query;
+    query.limit = 1000;
+    EXPECT_TRUE(Reader()->Search(query, hits));
+    for (const Hit& hit : hits) paths.insert(hit.path);
+    return paths;
+  }
+  std::vector<std::string> Find(const std::vector<std::string>& words, bool anyKind = true,
+                                Kind kind = Kind::kOther, std::size_t limit = 50) {
+    Query query;
+    query.words = words;
+    query.anyKind = anyKind;
+    query.kind = kind;
+    query.limit = limit;
+    std::vector<Hit> hits;
+    EXPECT_TRUE(Reader()->Search(query, hits));
+    std::vector<std::string> paths;
+    for (const Hit& hit : hits) paths.push_back(hit.path);
+    return paths;
+  }
+  std::unique_ptr<IndexReader> Reader() {
+    std::string error;
+    auto reader = IndexReader::Open(dir_ + "/db", error);
+    EXPECT_TRUE(reader) << error;
+    return reader;
+  }
+  std::string dir_;
+  std::unique_ptr<IndexWriter> writer_;
+};
+
+TEST_F(IndexStoreTest, RemovesWholeSubtreesOnly) {
+  // Siblings whose names begin with the removed directory's name, and the characters
+  // that sort just before and after "/", must survive.
+  for (const char* name : {"a", "a b", "a.b", "a-b", "ab", "a0"}) Put("", name, 1, true);
+  Put("a", "x.jpg");
+  Put("a", "sub", 1, true);
+  Put("a/sub", "deep.jpg");
+  Put("a b", "keep.jpg");
+  Put("a.b", "keep.jpg");
+  Put("a0", "keep.jpg");
+  ASSERT_TRUE(writer_->Remove("", "a"));
+  EXPECT_EQ(All(), (std::set<std::string>{"a b", "a.b", "a-b", "ab", "a0", "a b/keep.jpg", "a.b/keep.jpg",
+                                          "a0/keep.jpg"}));
+  // A file replaced by a directory of the same name and back: one entry, updated in place.
+  Put("", "ab", 2, false);
+  std::vector<Entry> children;
+  ASSERT_TRUE(writer_->ListChildren("", children));
+  EXPECT_EQ(children.size(), 5u);
+  ASSERT_TRUE(writer_->RemoveBelow(""));
+  EXPECT_TRUE(All().empty());
+}
+
+TEST_F(IndexStoreTest, SearchesWordPrefixesNewestFirst) {
+  Put("", "Beach_Holiday 2019.JPG", 10);
+  Put("", "beachfront.mp3", 30);
+  Put("", "Café del Mar.flac", 20);
+  Put("", "notes \"quoted\".txt", 5);
+  Put("", "seabeach.jpg", 40);  // "beach" inside a word is no match
+  Put("", "beaches", 50, true);
+  EXPECT_EQ(Find({"BEACH"}),
+            (std::vector<std::string>{"beaches", "beachfront.mp3", "Beach_Holiday 2019.JPG"}));
+  EXPECT_EQ(Find({"beach", "2019"}), (std::vector<std::string>{"Beach_Holiday 2019.JPG"}));
+  EXPECT_EQ(Find({"cafe"}), (std::vector<std::string>{"Café del Mar.flac"}));
+  EXPECT_EQ(Find({"beach"}, false, Kind::kAudio), (std::vector<std::string>{"beachfront.mp3"}));
+  EXPECT_EQ(Find({"beach"}, true, Kind::kOther, 1), (std::vector<std::string>{"beaches"}));
+  // Quotes and operators in a word are text, not query syntax; a word of no letters
+  // restricts nothing.
+  EXPECT_EQ(Find({"\"quoted"}), (std::vector<std::string>{"notes \"quoted\".txt"}));
+  EXPECT_EQ(Find({"notes", "OR", "AND"}).size(), 0u);
+  EXPECT_EQ(Find({"--"}).size(), 6u);
+
+  // Removing an entry removes it from the name index too.
+  ASSERT_TRUE(writer_->Remove("", "beachfront.mp3"));
+  EXPECT_EQ(Find({"beachf"}).size(), 0u);
+}
+
+TEST_F(IndexStoreTest, IndexIsPrivateAndReadersNeedOne) {
+  struct stat st;
+  ASSERT_EQ(::stat((dir_ + "/db").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0700u);
+  std::string error;
+  EXPECT_FALSE(IndexReader::Open(dir_ + "/none", error));
+  EXPECT_NE(error.find("/none/"), std::string::npos) << error;
+}
+
+}  // namespace
