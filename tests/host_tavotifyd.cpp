@@ -217,9 +217,10 @@ TEST_F(TavotifydTest, FollowsWatchListChanges) {
   EXPECT_FALSE(WaitFor(fileindex_queue::kCreated, share_ + "/docs/four", "", 500)) << "still watched";
 }
 
-// While another holder keeps the queue locked nothing is written, and once it lets go every
-// line arrives, once.
-TEST_F(TavotifydTest, HeldQueueLockDelaysButLosesNothing) {
+// While another holder keeps the queue locked nothing is written, and while the queue
+// cannot be written at all (its directory is gone) the reason is logged; once either
+// clears, every line arrives, once.
+TEST_F(TavotifydTest, BusyOrFailingQueueLosesNothing) {
   SetList({share_});
   Start();
   int lock = ::open(queue_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
@@ -235,6 +236,15 @@ TEST_F(TavotifydTest, HeldQueueLockDelaysButLosesNothing) {
     ASSERT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/f" + std::to_string(i)), 1u) << i;
     ASSERT_EQ(Count(fileindex_queue::kModified, share_ + "/docs/f" + std::to_string(i)), 1u) << i;
   }
+
+  fs::remove_all(share_ + "/@eaDir");
+  WriteFile(share_ + "/docs/while-failing", "x");
+  ASSERT_TRUE(WaitUntil([&] {
+    return Log().find("No such file or directory; keeping") != std::string::npos;
+  })) << Log();
+  fs::create_directories(share_ + "/@eaDir");
+  EXPECT_TRUE(WaitFor(fileindex_queue::kModified, share_ + "/docs/while-failing"));
+  EXPECT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/while-failing"), 1u);
 }
 
 // Lost events (the kernel's event queue overflowed while the daemon was stopped) ask for a

@@ -151,7 +151,32 @@ void WatchListDirectory::Walk(const std::string& dir, int depth, std::map<std::s
   for (const std::string& sub : subdirectories) Walk(sub, depth + 1, found);
 }
 
+void WatchListDirectory::WatchNearestAncestor() {
+  struct stat st;
+  bool topExists = ::lstat(m_top.c_str(), &st) == 0;
+  if (m_ancestorWatch >= 0 && (topExists || m_ancestor != ExistingAncestor())) {
+    ::inotify_rm_watch(m_inotify, m_ancestorWatch);
+    m_ancestorWatch = -1;
+  }
+  if (topExists || m_ancestorWatch >= 0) return;
+  // Until the tree exists, its creation (by the first list written) is noticed here rather
+  // than by the next periodic scan.
+  m_ancestor = ExistingAncestor();
+  m_ancestorWatch = ::inotify_add_watch(m_inotify, m_ancestor.c_str(), IN_CREATE | IN_MOVED_TO | IN_ONLYDIR);
+}
+
+std::string WatchListDirectory::ExistingAncestor() const {
+  std::string dir = m_top;
+  struct stat st;
+  do {
+    std::size_t slash = dir.rfind('/');
+    dir = slash == 0 || slash == std::string::npos ? "/" : dir.substr(0, slash);
+  } while (dir != "/" && ::lstat(dir.c_str(), &st) != 0);
+  return dir;
+}
+
 bool WatchListDirectory::Rescan() {
+  WatchNearestAncestor();
   std::map<std::string, FileIdentity> found;
   Walk(m_top, 0, found);
   bool changed = false;

@@ -68,9 +68,13 @@ class WatchListDirectory {
     std::string text;
   };
   void Walk(const std::string& dir, int depth, std::map<std::string, FileIdentity>& found);
+  void WatchNearestAncestor();
+  std::string ExistingAncestor() const;
 
   std::string m_top;
   int m_inotify = -1;
+  int m_ancestorWatch = -1;
+  std::string m_ancestor;
   std::map<std::string, KnownFile> m_files;
   std::map<std::string, WatchList> m_lists;
 };
