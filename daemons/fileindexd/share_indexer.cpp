@@ -84,7 +84,7 @@ bool ShareIndexer::Configure(const ShareConfig& config) {
     if (it == known.end() || !it->second.crawled || it->second.document != flags.document ||
         it->second.audio != flags.audio || it->second.video != flags.video ||
         it->second.photo != flags.photo) {
-      CrawlFolder(entry.first);
+      CrawlFolder(entry.first, false);
     }
   }
   for (const auto& entry : known) {
@@ -93,7 +93,19 @@ bool ShareIndexer::Configure(const ShareConfig& config) {
   return true;
 }
 
-void ShareIndexer::CrawlFolder(const std::string& folder) {
+void ShareIndexer::CrawlFolder(const std::string& folder, bool force) {
+  // A new folder is announced twice (its command and its queued settings event): one
+  // crawl serves both, unless the flags changed since it was queued.
+  auto flags = m_config.flags.find(folder);
+  auto queued = m_queuedCrawls.find(folder);
+  if (!force && flags != m_config.flags.end() && queued != m_queuedCrawls.end() &&
+      queued->second.flags == flags->second) {
+    return;
+  }
+  QueuedCrawl& crawl = m_queuedCrawls[folder];
+  if (flags != m_config.flags.end()) crawl.flags = flags->second;
+  crawl.since = Clock::now();
+  crawl.entriesBefore = m_entriesWritten;
   // The folder's own entry, then everything below it, then the mark that it is done: a
   // crawl pushes subdirectories to the front, so the mark runs after the whole tree.
   AddPathTask(folder);
@@ -219,7 +231,7 @@ bool ShareIndexer::ReconcileDirectory(const std::string& dir) {
     if (!dir.empty() && !m_store->Remove(DirName(dir), BaseName(dir))) return false;
     if (!m_store->RemoveBelow(dir)) return false;
     for (const auto& configured : m_config.flags) {
-      if (configured.first != dir && IsInside(configured.first, dir)) CrawlFolder(configured.first);
+      if (configured.first != dir && IsInside(configured.first, dir)) CrawlFolder(configured.first, true);
     }
     return true;
   }
@@ -283,6 +295,15 @@ bool ShareIndexer::ReconcileDirectory(const std::string& dir) {
 }
 
 bool ShareIndexer::FolderCrawled(const std::string& folder) {
+  auto queued = m_queuedCrawls.find(folder);
+  if (queued != m_queuedCrawls.end()) {
+    auto ms =
+        std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - queued->second.since).count();
+    Log(LOG_INFO, "share %s: folder /%s crawled in %lld ms (%llu entries written)", m_config.name.c_str(),
+        folder.c_str(), static_cast<long long>(ms),
+        static_cast<unsigned long long>(m_entriesWritten - queued->second.entriesBefore));
+    m_queuedCrawls.erase(queued);
+  }
   auto it = m_config.flags.find(folder);
   if (it == m_config.flags.end()) return true;  // removed meanwhile; its removal is queued
   fileindex_store::FolderState state;
@@ -382,7 +403,7 @@ void ShareIndexer::QueueLine(const char* line, std::size_t size) {
   }
   switch (event.code) {
     case fileindex_queue::kReindex:
-      CrawlFolder(path);
+      CrawlFolder(path, true);
       break;
     case fileindex_queue::kSettingsChanged:
       // The folder list is read again when folder.conf changes; crawl in case this event

@@ -13,6 +13,7 @@
 #include <chrono>
 #include <cstdint>
 #include <deque>
+#include <map>
 #include <memory>
 #include <string>
 #include <unordered_set>
@@ -65,7 +66,9 @@ class ShareIndexer {
   bool ReconcileDirectory(const std::string& dir);
   bool FolderCrawled(const std::string& folder);
   bool FolderGone(const std::string& folder);
-  void CrawlFolder(const std::string& folder);
+  // Crawls a folder with its current flags, unless such a crawl is already queued and
+  // `force` is false.
+  void CrawlFolder(const std::string& folder, bool force);
   void AddPathTask(const std::string& path);
 
   // The governing folder of a full path (relative to the share); false when none.
@@ -85,6 +88,13 @@ class ShareIndexer {
   std::unique_ptr<fileindex_store::IndexWriter> m_store;
   std::deque<Task> m_tasks;
   std::unordered_set<std::string> m_pendingPaths;
+  // Folders whose crawl is queued, with the flags it was queued for, and when it began.
+  struct QueuedCrawl {
+    FolderFlags flags;
+    Clock::time_point since;
+    std::uint64_t entriesBefore = 0;
+  };
+  std::map<std::string, QueuedCrawl> m_queuedCrawls;
   std::string m_error;
   std::uint64_t m_entriesWritten = 0;
 
