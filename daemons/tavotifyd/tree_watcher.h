@@ -4,7 +4,7 @@
 // Each directory has one watch, whatever number of folders (of one list or of several)
 // cover it; the watch records which folders own it. A directory inherits the owners of
 // its parent except those that ignore its name, so nested folders and the same directory
-// in two lists need nothing special. The watch mask is the owners' masks plus what
+// in two lists need no extra handling. The watch mask is the owners' masks plus what
 // recursion needs; a line is written only for the events an owner's mask asks for.
 #ifndef FILEINDEX_TAVOTIFYD_TREE_WATCHER_H
 #define FILEINDEX_TAVOTIFYD_TREE_WATCHER_H
