@@ -90,14 +90,14 @@ class TavotifydTest : public ::testing::Test {
   }
   // Runs the daemon (through `wrapper`, a command that ends by exec'ing its arguments) as
   // this process's child pid_, and waits until it watches.
-  void Start(const std::string& wrapper = "") {
+  void Start(const std::string& wrapper = "", const std::string& options = "") {
     pid_ = ::fork();
     ASSERT_GE(pid_, 0);
     if (pid_ == 0) {
       int log = ::open((root_ + "/daemon.log").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
       ::dup2(log, 1);
       ::dup2(log, 2);
-      const std::string command = "exec " + wrapper + " \"$0\" --sysroot \"$1\" --foreground";
+      const std::string command = "exec " + wrapper + " \"$0\" --sysroot \"$1\" --foreground " + options;
       ::execl("/bin/sh", "sh", "-c", command.c_str(), kDaemon.c_str(), root_.c_str(), nullptr);
       ::_exit(127);
     }
@@ -252,6 +252,22 @@ TEST_F(TavotifydTest, BusyOrFailingQueueLosesNothing) {
   fs::create_directories(share_ + "/@eaDir");
   EXPECT_TRUE(WaitFor(fileindex_queue::kModified, share_ + "/docs/while-failing"));
   EXPECT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/while-failing"), 1u);
+}
+
+// Past the bound on held lines, a queue's lines are replaced by a reindex of its folder.
+TEST_F(TavotifydTest, HeldLinesPastTheBoundBecomeAReindex) {
+  SetList({share_});
+  Start("", "--max-held-lines 50");
+  int lock = ::open(queue_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+  ASSERT_GE(lock, 0);
+  ASSERT_EQ(::flock(lock, LOCK_EX), 0);
+  for (int i = 0; i < 100; ++i) WriteFile(share_ + "/docs/f" + std::to_string(i), "x");
+  ASSERT_TRUE(WaitUntil([&] { return Log().find("replacing them by 1 reindex lines") != std::string::npos; }))
+      << Log();
+  ::close(lock);
+  ASSERT_TRUE(WaitFor(fileindex_queue::kReindex, share_));
+  EXPECT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/f99"), 0u);
+  EXPECT_LE(Events().size(), 51u);
 }
 
 // Lost events (the kernel's event queue overflowed while the daemon was stopped) ask for a

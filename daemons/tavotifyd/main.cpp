@@ -27,7 +27,7 @@ using fileindex_daemon::EventLoop;
 using fileindex_daemon::Log;
 using tavotifyd::TreeWatcher;
 
-const std::size_t kMaxHeldLinesPerQueue = 100000;
+const std::size_t kDefaultMaxHeldLines = 100000;
 const std::chrono::milliseconds kRescanPeriod(1000);
 // Lets a burst of list changes (a writer's temporary file, then its rename) settle into one re-read.
 const std::chrono::milliseconds kListSettle(20);
@@ -35,19 +35,21 @@ const std::chrono::milliseconds kShutdownFlushBudget(3000);
 
 void Usage(std::FILE* out) {
   std::fprintf(out,
-               "usage: tavotifyd [--sysroot DIR] [--foreground] [--help]\n"
+               "usage: tavotifyd [--sysroot DIR] [--foreground] [--max-held-lines N] [--help]\n"
                "Watches the folders of the watch lists in /run/tavotifyd and appends their file events\n"
                "to each list's queue.\n"
                "  --sysroot DIR  prefix DIR to every system path (as FILEINDEX_SYSROOT does)\n"
-               "  --foreground   log to stderr too (the service manager runs it this way)\n");
+               "  --foreground   log to stderr too (the service manager runs it this way)\n"
+               "  --max-held-lines N\n"
+               "                 lines held for a queue that cannot be written before they are replaced\n"
+               "                 by reindex lines of its folders (default 100000)\n");
 }
 
 class Daemon {
  public:
-  Daemon()
+  explicit Daemon(std::size_t maxHeldLines)
       : m_writer(
-            m_loop, [this](const std::string& queue) { return m_tree.FoldersOfQueue(queue); },
-            kMaxHeldLinesPerQueue),
+            m_loop, [this](const std::string& queue) { return m_tree.FoldersOfQueue(queue); }, maxHeldLines),
         m_tree(m_writer),
         m_lists(fileindex_daemon::Rooted("/run/tavotifyd")) {}
 
@@ -141,6 +143,7 @@ class Daemon {
 
 int main(int argc, char** argv) {
   bool foreground = false;
+  std::size_t maxHeldLines = kDefaultMaxHeldLines;
   for (int i = 1; i < argc; ++i) {
     std::string arg = argv[i];
     if (arg == "--help" || arg == "-h") {
@@ -148,6 +151,14 @@ int main(int argc, char** argv) {
       return 0;
     } else if (arg == "--foreground") {
       foreground = true;
+    } else if (arg == "--max-held-lines" && i + 1 < argc) {
+      char* end = nullptr;
+      unsigned long long value = std::strtoull(argv[++i], &end, 10);
+      if (*end != '\0' || value == 0) {
+        std::fprintf(stderr, "tavotifyd: --max-held-lines %s: not a positive number\n", argv[i]);
+        return 2;
+      }
+      maxHeldLines = static_cast<std::size_t>(value);
     } else if (arg == "--sysroot" && i + 1 < argc) {
       char resolved[PATH_MAX];
       if (::realpath(argv[++i], resolved) == nullptr) {
@@ -174,6 +185,6 @@ int main(int argc, char** argv) {
     }
     return 1;
   }
-  Daemon daemon;
+  Daemon daemon(maxHeldLines);
   return daemon.Run();
 }
