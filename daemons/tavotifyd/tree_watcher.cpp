@@ -448,7 +448,10 @@ void TreeWatcher::HandleSelf(int watch, std::uint32_t mask) {
   if (dir.rootOf.empty()) return;
   const Owners roots = dir.rootOf;
   if (mask & IN_ATTRIB) Report(roots, IN_ATTRIB, queue::kAttributes, dir.path);
-  if (mask & IN_DELETE_SELF) Report(roots, IN_DELETE_SELF | IN_DELETE, queue::kDeleted, dir.path);
+  if (mask & IN_DELETE_SELF) {
+    Log(LOG_WARNING, "folder %s was removed; it is watched again once it is back", dir.path.c_str());
+    Report(roots, IN_DELETE_SELF | IN_DELETE, queue::kDeleted, dir.path);
+  }
   if (mask & IN_MOVE_SELF) {
     // The folder's path no longer names this directory: stop following it; a directory
     // that appears at the path later is watched (and reindexed) then.
