@@ -94,7 +94,7 @@ class TavotifydTest : public ::testing::Test {
     pid_ = ::fork();
     ASSERT_GE(pid_, 0);
     if (pid_ == 0) {
-      int log = ::open((root_ + "/daemon.log").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
+      int log = ::open((root_ + "/daemon.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
       ::dup2(log, 1);
       ::dup2(log, 2);
       const std::string command = "exec " + wrapper + " \"$0\" --sysroot \"$1\" --foreground " + options;
