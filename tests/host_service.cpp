@@ -1,0 +1,570 @@
+// The indexing service end to end: fileindexd and tavotifyd started by a sandbox's service
+// hooks, driven through fileindexctl, the command socket and the queue files, and checked
+// against the share's index database and the disk.
+#include <fcntl.h>
+#include <grp.h>
+#include <gtest/gtest.h>
+#include <json/json.h>
+#include <sqlite3.h>
+#include <sys/file.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <csignal>
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <random>
+#include <set>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+using Clock = std::chrono::steady_clock;
+
+namespace {
+
+const std::string kCtl = FILEINDEX_BINARY_DIR "/tools/fileindexctl/fileindexctl";
+// Generous, for the sanitizer build; a healthy daemon answers in a fraction of it.
+constexpr auto kDeadline = 20s;
+
+struct Result {
+  int status;
+  std::string out, err;
+};
+
+std::string ReadFile(const std::string& path) {
+  std::stringstream text;
+  text << std::ifstream(path).rdbuf();
+  return text.str();
+}
+
+void WriteFile(const std::string& path, const std::string& text) {
+  fs::create_directories(fs::path(path).parent_path());
+  std::ofstream(path, std::ios::trunc) << text;
+}
+
+Json::Value ParseJson(const std::string& text) {
+  Json::CharReaderBuilder builder;
+  std::istringstream in(text);
+  Json::Value value;
+  return Json::parseFromStream(builder, in, &value, nullptr) ? value : Json::Value();
+}
+
+// Polls every 20 ms until ready() holds or the time is up.
+template <class Ready>
+bool WaitUntil(Ready ready, Clock::duration limit = kDeadline) {
+  for (auto end = Clock::now() + limit;; std::this_thread::sleep_for(20ms)) {
+    if (ready()) return true;
+    if (Clock::now() >= end) return false;
+  }
+}
+
+std::size_t Count(const std::string& text, const std::string& what) {
+  std::size_t count = 0;
+  for (std::size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++count;
+  return count;
+}
+
+std::string Quote(const std::string& text) {
+  std::string quoted = "'";
+  for (char c : text) quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
+  return quoted + "'";
+}
+
+int Connect(const std::string& path) {
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
+  if (fd >= 0 && ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0) return fd;
+  int error = errno;
+  if (fd >= 0) ::close(fd);
+  errno = error;
+  return -1;
+}
+
+void Send(int fd, const std::string& bytes) { ::send(fd, bytes.data(), bytes.size(), MSG_NOSIGNAL); }
+
+std::string LengthField(std::uint32_t length) { return std::string(reinterpret_cast<char*>(&length), 4); }
+
+class ServiceTest : public ::testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    // The daemons outlive the hooks that start them; as a subreaper this process reaps them.
+    ::prctl(PR_SET_CHILD_SUBREAPER, 1);
+    ::unsetenv("FILEINDEX_SYSROOT");
+  }
+  void SetUp() override {
+    char pattern[] = "/tmp/host_service.XXXXXX";
+    ASSERT_NE(::mkdtemp(pattern), nullptr);
+    work_ = pattern;
+    ::chmod(work_.c_str(), 0755);  // other users reach the socket and the index, as on a host
+    root_ = work_ + "/root";
+    ASSERT_EQ(Run({"sandbox", "init", root_}, false).status, 0);
+    root_ = fs::canonical(root_).string();
+  }
+  void TearDown() override {
+    if (root_.empty() || work_.empty()) return;
+    std::vector<pid_t> pids{Pid("fileindexd"), Pid("tavotifyd")};
+    Run({"sandbox", "stop"});
+    for (pid_t pid : pids) {
+      // Only a daemon of this sandbox, in case the stop failed.
+      if (pid > 0 && ReadFile("/proc/" + std::to_string(pid) + "/cmdline").find(root_) != std::string::npos)
+        ::kill(pid, SIGKILL);
+      if (pid > 0) ::waitpid(pid, nullptr, 0);
+    }
+    while (::waitpid(-1, nullptr, WNOHANG) > 0) continue;
+    // Sanitizer builds report into the daemons' logs, some of it only at exit.
+    for (const char* log : {"fileindexd.log", "tavotifyd.log"}) {
+      std::string text = ReadFile(root_ + "/var/log/" + log);
+      EXPECT_EQ(text.find("Sanitizer"), std::string::npos) << log << ":\n" << text;
+      EXPECT_EQ(text.find("runtime error"), std::string::npos) << log << ":\n" << text;
+    }
+    fs::remove_all(work_);
+  }
+  Result Run(const std::vector<std::string>& args, bool sysroot = true, const std::string& prefix = "") {
+    std::string command = prefix + kCtl + (sysroot ? " --sysroot " + Quote(root_) : "");
+    for (const std::string& arg : args) command += " " + Quote(arg);
+    int status = std::system((command + " >" + work_ + "/stdout 2>" + work_ + "/stderr").c_str());
+    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, ReadFile(work_ + "/stdout"),
+            ReadFile(work_ + "/stderr")};
+  }
+  Json::Value RunJson(std::vector<std::string> args) {
+    args.insert(args.begin(), "--json");
+    Result result = Run(args);
+    EXPECT_EQ(result.status, 0) << result.out << result.err;
+    return ParseJson(result.out);
+  }
+  std::string Status() { return RunJson({"status"})["status"].asString(); }
+  // The share paths that a search for words finds.
+  std::set<std::string> Search(const std::string& words) {
+    std::set<std::string> paths;
+    lastSearch_ = RunJson({"search", "--limit", "100000", words});
+    for (const Json::Value& hit : lastSearch_["hits"]) paths.insert(hit["path"].asString());
+    return paths;
+  }
+  bool Found(const std::string& words, const std::string& path) { return Search(words).count(path) > 0; }
+  ::testing::AssertionResult WaitFound(const std::string& words, const std::string& path, bool found = true) {
+    if (WaitUntil([&] { return Found(words, path) == found; })) return ::testing::AssertionSuccess();
+    return ::testing::AssertionFailure() << path << (found ? " never found" : " still found") << "; search "
+                                         << words << ": " << lastSearch_.toStyledString() << "daemon log:\n"
+                                         << Log();
+  }
+  ::testing::AssertionResult WaitGone(const std::string& words, const std::string& path) {
+    return WaitFound(words, path, false);
+  }
+  ::testing::AssertionResult Add(const std::vector<std::string>& args) {
+    std::vector<std::string> command{"folders", "add"};
+    command.insert(command.end(), args.begin(), args.end());
+    Result result = Run(command);
+    if (result.status == 0) return ::testing::AssertionSuccess();
+    return ::testing::AssertionFailure() << "folders add: " << result.err;
+  }
+  // The service has nothing left to do: status "finished", no queue and no ".tmp" companion.
+  bool WaitIdle() {
+    return WaitUntil([&] {
+      for (const char* share : {"photo", "video"}) {
+        if (fs::exists(Queue(share)) || fs::exists(Queue(share) + ".tmp")) return false;
+      }
+      return Status() == "finished";
+    });
+  }
+
+  pid_t Pid(const std::string& daemon) {
+    std::string text = ReadFile(root_ + "/var/run/" + daemon + ".pid");
+    return text.empty() ? 0 : static_cast<pid_t>(std::atoi(text.c_str()));
+  }
+  std::string Share(const std::string& name) { return root_ + "/volume1/" + name; }
+  std::string Queue(const std::string& share) { return Share(share) + "/@eaDir/TAVO@file_index_queue"; }
+  std::string Database(const std::string& share) {
+    return Share(share) + "/@eaDir/TAVO@.fileindexdb/index.sqlite3";
+  }
+  std::string Log() { return ReadFile(root_ + "/var/log/fileindexd.log"); }
+  int StartHook(const std::string& daemon) {
+    return std::system((root_ + "/etc/tavo/services/" + daemon + " start").c_str());
+  }
+
+  // The share's index: path relative to the share (directories end in "/") -> governing folder.
+  std::map<std::string, std::string> IndexEntries(const std::string& share) {
+    std::map<std::string, std::string> entries;
+    sqlite3* db = nullptr;
+    if (sqlite3_open_v2(Database(share).c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
+      sqlite3_stmt* rows = nullptr;
+      sqlite3_prepare_v2(db, "SELECT parent, name, is_dir, folder FROM entries", -1, &rows, nullptr);
+      while (rows != nullptr && sqlite3_step(rows) == SQLITE_ROW) {
+        std::string parent = reinterpret_cast<const char*>(sqlite3_column_text(rows, 0));
+        std::string path = (parent.empty() ? "" : parent + "/") +
+                           reinterpret_cast<const char*>(sqlite3_column_text(rows, 1)) +
+                           (sqlite3_column_int(rows, 2) ? "/" : "");
+        entries[path] = reinterpret_cast<const char*>(sqlite3_column_text(rows, 3));
+      }
+      sqlite3_finalize(rows);
+    }
+    EXPECT_NE(db, nullptr);
+    sqlite3_close(db);
+    return entries;
+  }
+  std::set<std::string> IndexPaths(const std::string& share) {
+    std::set<std::string> paths;
+    for (const auto& entry : IndexEntries(share)) paths.insert(entry.first);
+    return paths;
+  }
+  // What the index must hold for the folder `top` (relative to the share): every directory,
+  // and every file whose extension wanted() accepts; "@eaDir" directories are not looked into.
+  template <class Wanted>
+  std::set<std::string> DiskPaths(const std::string& share, const std::string& top, Wanted wanted) {
+    std::set<std::string> paths{top + "/"};
+    const fs::path base = Share(share);
+    for (auto it = fs::recursive_directory_iterator(base / top); it != fs::recursive_directory_iterator();
+         ++it) {
+      const std::string relative = it->path().lexically_relative(base).string();
+      if (it->is_directory()) {
+        if (it->path().filename() == "@eaDir") {
+          it.disable_recursion_pending();
+        } else {
+          paths.insert(relative + "/");
+        }
+      } else if (wanted(it->path().extension().string())) {
+        paths.insert(relative);
+      }
+    }
+    return paths;
+  }
+
+  std::string work_, root_;
+  Json::Value lastSearch_;
+};
+
+// The tour: add, search, create, rename, switch a kind off, pause, resume, remove.
+TEST_F(ServiceTest, FoldersFollowTheFileSystemAndTheSettings) {
+  WriteFile(Share("photo") + "/2019/notes.txt", "notes\n");
+  ASSERT_TRUE(Add({"/photo/2019", "/photo/2020"}));
+  ASSERT_TRUE(Add({"/video/movies", "--video"}));
+  ASSERT_TRUE(WaitIdle());
+  EXPECT_EQ(Search("beach"), std::set<std::string>{"/photo/2019/beach.jpg"});
+  EXPECT_EQ(Search("HOLI"), std::set<std::string>{"/video/movies/holiday.mkv"});  // prefix, any case
+  EXPECT_TRUE(Search("deleted").empty());                                         // never in a folder
+
+  const std::string dir2019 = Share("photo") + "/2019";
+  WriteFile(dir2019 + "/sunset.jpg", "sun\n");
+  auto created = Clock::now();
+  ASSERT_TRUE(WaitFound("sunset", "/photo/2019/sunset.jpg"));
+  EXPECT_LT(Clock::now() - created, 2s);
+  fs::rename(dir2019 + "/sunset.jpg", dir2019 + "/dusk.jpg");
+  ASSERT_TRUE(WaitFound("dusk", "/photo/2019/dusk.jpg"));
+  EXPECT_TRUE(Search("sunset").empty());
+
+  // Photos off in 2019: its photos go, its documents and 2020's photos stay.
+  ASSERT_EQ(Run({"folders", "set", "/photo/2019", "--no-photo"}).status, 0);
+  ASSERT_TRUE(WaitGone("dusk", "/photo/2019/dusk.jpg"));
+  ASSERT_TRUE(WaitIdle());
+  EXPECT_TRUE(Search("beach").empty());
+  EXPECT_TRUE(Found("notes", "/photo/2019/notes.txt"));
+  EXPECT_TRUE(Found("city", "/photo/2020/city.jpg"));
+
+  ASSERT_EQ(Run({"pause", "0"}).status, 0);
+  WriteFile(Share("photo") + "/2020/paused.jpg", "p\n");
+  ASSERT_TRUE(WaitUntil([&] { return fs::exists(Queue("photo")); }));  // the event waits in the queue
+  std::this_thread::sleep_for(300ms);
+  EXPECT_EQ(Status(), "paused");
+  EXPECT_FALSE(Found("paused", "/photo/2020/paused.jpg"));
+  ASSERT_EQ(Run({"resume"}).status, 0);
+  EXPECT_TRUE(WaitFound("paused", "/photo/2020/paused.jpg"));
+  EXPECT_TRUE(WaitIdle());
+
+  ASSERT_EQ(Run({"folders", "remove", "/photo/2020"}).status, 0);
+  EXPECT_TRUE(WaitGone("city", "/photo/2020/city.jpg"));
+  EXPECT_TRUE(WaitIdle());
+  for (const std::string& path : IndexPaths("photo"))
+    EXPECT_EQ(path.rfind("2020", 0), std::string::npos) << path;
+  EXPECT_TRUE(Found("notes", "/photo/2019/notes.txt"));
+  EXPECT_TRUE(Found("holiday", "/video/movies/holiday.mkv"));
+}
+
+// An inner folder governs its tree; once removed, the outer folder takes its files over.
+TEST_F(ServiceTest, RemovingAnInnerFolderHandsItsFilesToTheOuterOne) {
+  ASSERT_TRUE(Add({"/photo"}));
+  ASSERT_TRUE(Add({"/photo/2019", "--document"}));
+  ASSERT_TRUE(WaitIdle());
+  EXPECT_TRUE(Search("beach").empty());
+  EXPECT_TRUE(Found("city", "/photo/2020/city.jpg"));
+  EXPECT_TRUE(Search("deleted").empty());  // the recycle bin and snapshots are never indexed
+  EXPECT_EQ(IndexEntries("photo")["2019/"], "2019");
+
+  ASSERT_EQ(Run({"folders", "remove", "/photo/2019"}).status, 0);
+  ASSERT_TRUE(WaitFound("beach", "/photo/2019/beach.jpg"));
+  ASSERT_TRUE(WaitIdle());
+  std::map<std::string, std::string> entries = IndexEntries("photo");
+  EXPECT_EQ(entries["2019/beach.jpg"], "");
+  EXPECT_EQ(entries["2019/"], "");
+}
+
+// Killed again and again while it consumes a queue under a stream of changes, the daemon
+// still ends with an index equal to the disk: no event lost, nothing stale.
+TEST_F(ServiceTest, IndexEqualsDiskAfterRepeatedKillsUnderChanges) {
+  const std::string top = Share("photo") + "/stress";
+  const std::vector<std::string> extensions{".jpg", ".txt", ".mp3", ".mkv", ".dat"};
+  std::vector<std::string> files;  // relative to top
+  for (int d = 0; d < 6; ++d) {
+    for (int f = 0; f < 50; ++f) {
+      files.push_back("d" + std::to_string(d) + "/f" + std::to_string(f) + extensions[f % 5]);
+      WriteFile(top + "/" + files.back(), "x\n");
+    }
+  }
+  WriteFile(top + "/d0/@eaDir/thumb.jpg", "t\n");
+  ASSERT_TRUE(Add({"/photo/stress", "--photo", "--document"}));
+  ASSERT_TRUE(WaitIdle());
+
+  std::atomic<bool> stop{false};
+  std::thread writer([&] {
+    std::mt19937 random(18);
+    std::vector<std::string> dirs;
+    std::error_code ignored;
+    for (int n = 0; !stop; ++n, std::this_thread::sleep_for(2ms)) {
+      auto pick = [&](std::size_t size) { return static_cast<std::size_t>(random() % size); };
+      std::string name = "n" + std::to_string(n) + extensions[pick(extensions.size())];
+      std::string dir = "d" + std::to_string(pick(6));
+      std::size_t op = files.empty() ? 0 : pick(10);
+      if (op < 4) {
+        files.push_back(dir + "/" + name);
+        WriteFile(top + "/" + files.back(), "x\n");
+      } else if (op < 6) {  // within or across directories, maybe to a kind switched off
+        std::string& file = files[pick(files.size())];
+        fs::rename(top + "/" + file, top + "/" + dir + "/" + name, ignored);
+        if (!ignored) file = dir + "/" + name;
+      } else if (op < 8) {
+        std::size_t i = pick(files.size());
+        fs::remove(top + "/" + files[i], ignored);
+        files.erase(files.begin() + static_cast<std::ptrdiff_t>(i));
+      } else if (op == 8 || dirs.empty()) {  // a new directory with a few files
+        dirs.push_back("n" + std::to_string(n));
+        for (int f = 0; f < 3; ++f) {
+          files.push_back(dirs.back() + "/f" + std::to_string(f) + extensions[pick(extensions.size())]);
+          WriteFile(top + "/" + files.back(), "x\n");
+        }
+      } else {  // a directory made here moves, with its files
+        std::string& from = dirs[pick(dirs.size())];
+        const std::string to = "m" + std::to_string(n);
+        fs::rename(top + "/" + from, top + "/" + to, ignored);
+        if (ignored) continue;
+        for (std::string& file : files) {
+          if (file.rfind(from + "/", 0) == 0) file = to + file.substr(from.size());
+        }
+        from = to;
+      }
+    }
+  });
+  struct Join {
+    std::atomic<bool>& stop;
+    std::thread& thread;
+    ~Join() {
+      stop = true;
+      if (thread.joinable()) thread.join();
+    }
+  } join{stop, writer};
+
+  std::mt19937 random(2019);
+  const std::string inProgress = Queue("photo") + ".tmp";
+  int killedWhileConsuming = 0;
+  for (int kill = 0; kill < 15; ++kill) {
+    // Now and then a whole crawl is queued too, to be cut short.
+    if (kill % 3 == 0) {
+      ASSERT_EQ(Run({"reindex", "/photo/stress"}).status, 0);
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(20 + random() % 80));
+    for (auto end = Clock::now() + 300ms; !fs::exists(inProgress) && Clock::now() < end;)
+      std::this_thread::sleep_for(1ms);
+    pid_t pid = Pid("fileindexd");
+    ASSERT_GT(pid, 0);
+    ASSERT_EQ(::kill(pid, SIGKILL), 0);
+    ASSERT_EQ(::waitpid(pid, nullptr, 0), pid);
+    killedWhileConsuming += fs::exists(inProgress);
+    std::this_thread::sleep_for(20ms);  // changes pile up in the queue meanwhile
+    ASSERT_EQ(StartHook("fileindexd"), 0) << Log();
+  }
+  stop = true;
+  writer.join();
+  ASSERT_TRUE(WaitIdle()) << Status();
+  EXPECT_GE(killedWhileConsuming, 5);
+  auto wanted = [](const std::string& ext) { return ext != ".mp3" && ext != ".mkv"; };
+  EXPECT_EQ(IndexPaths("photo"), DiskPaths("photo", "stress", wanted));
+}
+
+// Malformed, truncated and oversized lines are logged and skipped; the good lines around
+// them are applied and the queue is finished.
+TEST_F(ServiceTest, BadQueueLinesAreSkippedAndTheRestApplied) {
+  ASSERT_TRUE(Add({"/photo/2019"}));
+  ASSERT_TRUE(WaitIdle());
+  ASSERT_EQ(Run({"sandbox", "stop"}).status, 0);
+  // Made while nothing watches: only the queue can tell the daemon about them.
+  const std::string dir = Share("photo") + "/2019";
+  for (const char* name : {"first.jpg", "second.jpg", "third.jpg", "unqueued.jpg"})
+    WriteFile(dir + "/" + name, "q\n");
+  auto line = [&](const std::string& name) {
+    return "{\"event\":1,\"path\":\"" + dir + "/" + name + "\",\"data\":null}\n";
+  };
+  const std::string lines = line("first.jpg") + "not json at all\n" + "{\"event\":1,\"pa\n" +
+                            "{\"event\":\"x\",\"path\":7}\n" + "[1,2]\n" + line("second.jpg") +
+                            "{\"event\":1,\"path\":\"" + std::string(300 * 1024, 'x') + "\"}\n" +
+                            line("third.jpg") + "{\"event\":1,\"path\":\"" + dir;  // torn: its writer died
+  int fd = ::open(Queue("photo").c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0600);
+  ASSERT_GE(fd, 0);
+  ASSERT_EQ(::flock(fd, LOCK_EX), 0);
+  ASSERT_EQ(::write(fd, lines.data(), lines.size()), static_cast<ssize_t>(lines.size()));
+  ::close(fd);
+
+  ASSERT_EQ(StartHook("fileindexd"), 0);
+  ASSERT_TRUE(WaitIdle()) << Log();
+  for (const char* name : {"first", "second", "third"})
+    EXPECT_TRUE(Found(name, "/photo/2019/" + std::string(name) + ".jpg")) << name;
+  EXPECT_TRUE(Search("unqueued").empty());
+  const std::string log = Log();
+  EXPECT_EQ(Count(log, "malformed line skipped"), 4u) << log;
+  EXPECT_NE(log.find("line over"), std::string::npos) << log;
+  EXPECT_NE(log.find("torn last line skipped"), std::string::npos) << log;
+  EXPECT_EQ(::kill(Pid("fileindexd"), 0), 0);
+}
+
+// Clients that lie about a frame's length, send garbage or nothing at all neither crash
+// nor block the daemon: it keeps serving real commands meanwhile.
+TEST_F(ServiceTest, HostileSocketClientsNeitherCrashNorBlockTheDaemon) {
+  ASSERT_TRUE(Add({"/photo/2019"}));
+  ASSERT_TRUE(WaitIdle());
+  const pid_t pid = Pid("fileindexd");
+  const std::string socket = root_ + "/var/run/fileindexd.sock";
+  int silent = Connect(socket);
+  int hugeLength = Connect(socket);
+  ASSERT_GE(silent, 0);
+  ASSERT_GE(hugeLength, 0);
+  Send(hugeLength, LengthField(0x80000000u) + "{\"type\":\"pause\"");
+  std::mt19937 random(3);
+  std::string garbage(4096, '\0');
+  for (char& c : garbage) c = static_cast<char>(random());
+  const std::string pause = "{\"type\":\"delete_share_worker\",\"data\":{\"share_name\":\"photo\"}}";
+  for (const std::string& bytes :
+       {LengthField(1000) + "{\"type\":", garbage, LengthField(6) + "hello" + std::string(1, '\0'),
+        LengthField(static_cast<std::uint32_t>(pause.size() + 1)) + pause,  // no terminating zero
+        LengthField(3) + "[]" + std::string(1, '\0'), std::string("\x01\x00", 2)}) {
+    int fd = Connect(socket);
+    ASSERT_GE(fd, 0);
+    Send(fd, bytes);
+    ::close(fd);
+  }
+
+  // While those two connections are still open, a real command is served.
+  ASSERT_EQ(Run({"send", "delete_share_worker", "{\"share_name\":\"photo\"}"}).status, 0);
+  ASSERT_TRUE(WaitUntil([&] { return Log().find("share photo: worker stopped") != std::string::npos; }))
+      << Log();
+  EXPECT_EQ(Count(Log(), "worker stopped"), 1u) << "a malformed frame was obeyed";
+  WriteFile(Share("photo") + "/2019/stopped.jpg", "s\n");
+  ASSERT_EQ(Run({"share", "revive", "photo"}).status, 0);
+  EXPECT_TRUE(WaitFound("stopped", "/photo/2019/stopped.jpg"));
+  ASSERT_TRUE(Add({"/video/movies"}));
+  EXPECT_TRUE(WaitFound("holiday", "/video/movies/holiday.mkv"));
+
+  // The silent client is dropped in time, and it is the same daemon all along.
+  char byte;
+  EXPECT_TRUE(WaitUntil([&] { return ::recv(silent, &byte, 1, MSG_DONTWAIT) == 0; }, 10s));
+  ::close(silent);
+  ::close(hugeLength);
+  EXPECT_EQ(Pid("fileindexd"), pid);
+  EXPECT_EQ(::kill(pid, 0), 0);
+  EXPECT_NE(Log().find("frame length out of range"), std::string::npos) << Log();
+}
+
+// A share short of space is marked, the administrators told once, and its indexing stops
+// (other shares go on) until it is revived.
+TEST_F(ServiceTest, ShareOutOfSpaceStopsUntilRevived) {
+  ASSERT_TRUE(Add({"/photo/2019", "/video/movies"}));
+  ASSERT_TRUE(WaitIdle());
+  const std::string table = root_ + "/etc/tavo/shares.json";
+  auto setFree = [&](const Json::Value& bytes) {
+    Json::Value shares = ParseJson(ReadFile(table));
+    for (Json::Value& share : shares["shares"]) {
+      if (share["name"] == "photo") share["free_bytes"] = bytes;
+      if (bytes.isNull()) share.removeMember("free_bytes");
+    }
+    WriteFile(table + ".new", Json::writeString(Json::StreamWriterBuilder(), shares));
+    fs::rename(table + ".new", table);
+  };
+  setFree(Json::Int64(1 << 20));
+  auto noSpace = [&] {
+    return ParseJson(ReadFile(root_ + "/usr/tavo/etc/fileindex/status.conf"))["no_space"]["photo"] == true;
+  };
+  // Space is looked at before work, at most once a second: changes come until it is.
+  for (int i = 0; i < 20 && !noSpace(); ++i) {
+    WriteFile(Share("photo") + "/2019/fill" + std::to_string(i) + ".jpg", "f\n");
+    WaitUntil(noSpace, 300ms);
+  }
+  ASSERT_TRUE(noSpace());
+  WriteFile(Share("photo") + "/2019/late.jpg", "l\n");
+  WriteFile(Share("video") + "/movies/trailer.mkv", "t\n");
+  ASSERT_TRUE(WaitFound("trailer", "/video/movies/trailer.mkv"));  // the other share goes on
+  EXPECT_FALSE(Found("late", "/photo/2019/late.jpg"));
+  Json::Value status = RunJson({"status"});
+  for (const Json::Value& folder : status["folders"]) {
+    EXPECT_EQ(folder["status"], folder["path"] == "/photo/2019" ? "err_no_space" : "finished") << folder;
+  }
+  std::string notes = ReadFile(root_ + "/var/log/notify.log");
+  EXPECT_EQ(Count(notes, "\n"), 1u) << notes;
+  EXPECT_EQ(Count(notes, "notify_no_space"), 1u) << notes;
+
+  setFree(Json::Value());
+  ASSERT_EQ(Run({"share", "revive", "photo"}).status, 0);
+  EXPECT_TRUE(WaitFound("late", "/photo/2019/late.jpg"));
+  EXPECT_TRUE(WaitIdle());
+  EXPECT_FALSE(noSpace());
+}
+
+// File names are root's: another user can neither command the daemon, read an index, nor search.
+TEST_F(ServiceTest, OtherUsersCannotCommandReadOrSearch) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to switch to another user";
+  ASSERT_TRUE(Add({"/photo/2019"}));
+  ASSERT_TRUE(WaitIdle());
+  ASSERT_TRUE(Found("beach", "/photo/2019/beach.jpg"));
+  const std::string socket = root_ + "/var/run/fileindexd.sock";
+  const std::string db = Database("photo");
+  for (const std::string& path : {db, fs::path(db).parent_path().string()})
+    EXPECT_EQ(fs::status(path).permissions() & (fs::perms::group_all | fs::perms::others_all),
+              fs::perms::none)
+        << path;
+
+  pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    // Exit code: bit 0 set when the socket accepted, bit 1 when the index opened, bit 2
+    // when the socket could not even be looked at (the test would prove nothing).
+    if (::setgroups(0, nullptr) != 0 || ::setgid(65534) != 0 || ::setuid(65534) != 0) ::_exit(64);
+    struct stat st;
+    int code = ::stat(socket.c_str(), &st) != 0 ? 4 : 0;
+    int fd = Connect(socket);
+    if (fd >= 0 || errno != EACCES) code |= 1;
+    if (::open(db.c_str(), O_RDONLY | O_CLOEXEC) >= 0) code |= 2;
+    ::_exit(code);
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0) << "1: connected, 2: read the index, 4: no socket, 64: no setuid";
+
+  Result search = Run({"search", "beach"}, true, "setpriv --reuid=nobody --regid=nogroup --clear-groups ");
+  EXPECT_NE(search.status, 0);
+  EXPECT_NE(search.err.find("only root may search"), std::string::npos) << search.err;
+  EXPECT_EQ(search.out.find("beach"), std::string::npos) << search.out;
+}
+
+}  // namespace
