@@ -69,6 +69,16 @@ class Daemon {
         });
     });
     ReloadLists();
+    // Lists that were there before this start may have missed changes while no daemon
+    // watched: their folders are reconciled once.
+    std::size_t reconciled = 0;
+    for (const auto& list : m_lists.Lists()) {
+      for (const auto& folder : list.second.folders) {
+        m_writer.AddReindex(list.second.queue, folder.path);
+        ++reconciled;
+      }
+    }
+    if (reconciled != 0) Log(LOG_INFO, "%zu folders watched before this start are reindexed", reconciled);
     m_writer.Flush();
     ScheduleTick();
     Log(LOG_INFO, "started: %zu folders of %zu watch lists, %zu directories watched", m_tree.FolderCount(),
