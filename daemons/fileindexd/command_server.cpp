@@ -81,16 +81,19 @@ bool CommandServer::Listen(const std::string& path, gid_t group, std::string& er
 
 void CommandServer::Accept() {
   for (;;) {
+    if (m_connections.size() >= kMaxConnections) {
+      // Closing new clients would lose the commands of real senders among them: they wait
+      // in the listen backlog instead, until a client is served or dropped.
+      if (!m_acceptPaused) Log(LOG_ERR, "too many clients at once; new ones wait");
+      m_acceptPaused = true;
+      m_loop.Unwatch(m_listener);
+      return;
+    }
     int fd = ::accept4(m_listener, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
     if (fd < 0) {
       if (errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR)
         Log(LOG_ERR, "accept on %s: %s", m_path.c_str(), std::strerror(errno));
       return;
-    }
-    if (m_connections.size() >= kMaxConnections) {
-      Log(LOG_ERR, "too many clients at once; connection dropped");
-      ::close(fd);
-      continue;
     }
     Connection& connection = m_connections[fd];
     connection.timer = m_loop.After(kIdleLimit, [this, fd]() {
@@ -150,6 +153,10 @@ void CommandServer::Drop(int fd, const char* reason) {
   m_loop.Unwatch(fd);
   ::close(fd);
   m_connections.erase(it);
+  if (m_acceptPaused) {
+    m_acceptPaused = false;
+    m_loop.Watch(m_listener, EPOLLIN, [this](std::uint32_t) { Accept(); });
+  }
 }
 
 }  // namespace fileindexd

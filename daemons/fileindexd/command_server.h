@@ -38,6 +38,7 @@ class CommandServer {
   Handler m_handler;
   std::string m_path;
   int m_listener = -1;
+  bool m_acceptPaused = false;  // at the connection limit, the listener is not watched
   std::map<int, Connection> m_connections;
 };
 
