@@ -24,17 +24,15 @@ const char kSchema[] =
     "  is_dir INTEGER NOT NULL, size INTEGER NOT NULL, mtime INTEGER NOT NULL,"
     "  kind INTEGER NOT NULL, folder TEXT NOT NULL);"
     "CREATE UNIQUE INDEX IF NOT EXISTS entries_by_place ON entries(parent, name);"
-    // Names only; the rows live in entries (an external-content index kept in step by
-    // the triggers below).
+    // Names only; the rows live in entries (an external-content index that the writer
+    // keeps in step, statement by statement). Not by triggers: a statement that fires a
+    // trigger opens a statement savepoint, and the full-text index writes out its pending
+    // terms at every savepoint, so a trigger made each row a segment of its own to merge.
     "CREATE VIRTUAL TABLE IF NOT EXISTS names USING fts5(name, content='entries', content_rowid='id',"
     "  tokenize='unicode61 remove_diacritics 2', prefix='2 3');"
-    "CREATE TRIGGER IF NOT EXISTS entries_added AFTER INSERT ON entries BEGIN"
-    "  INSERT INTO names(rowid, name) VALUES (new.id, new.name); END;"
-    "CREATE TRIGGER IF NOT EXISTS entries_removed AFTER DELETE ON entries BEGIN"
-    "  INSERT INTO names(names, rowid, name) VALUES ('delete', old.id, old.name); END;"
-    "CREATE TRIGGER IF NOT EXISTS entries_renamed AFTER UPDATE OF name ON entries BEGIN"
-    "  INSERT INTO names(names, rowid, name) VALUES ('delete', old.id, old.name);"
-    "  INSERT INTO names(rowid, name) VALUES (new.id, new.name); END;"
+    "DROP TRIGGER IF EXISTS entries_added;"
+    "DROP TRIGGER IF EXISTS entries_removed;"
+    "DROP TRIGGER IF EXISTS entries_renamed;"
     "CREATE TABLE IF NOT EXISTS folders(path TEXT PRIMARY KEY, document INTEGER NOT NULL,"
     "  audio INTEGER NOT NULL, video INTEGER NOT NULL, photo INTEGER NOT NULL,"
     "  crawled INTEGER NOT NULL) WITHOUT ROWID;";
@@ -234,38 +232,78 @@ bool IndexWriter::Find(const std::string& parent, const std::string& name, Entry
   return rc == SQLITE_ROW || rc == SQLITE_DONE || Fail("find");
 }
 
+// A new entry is inserted together with its name in the full-text index; a known one is
+// updated in place (its place, and so its name, never changes).
 bool IndexWriter::Put(const Entry& entry) {
-  Statement* statement = Prepare(
+  Statement* insert = Prepare(
       "INSERT INTO entries(parent, name, ext, is_dir, size, mtime, kind, folder) VALUES (?, ?, ?, ?, ?, ?, "
-      "?, ?)"
-      " ON CONFLICT(parent, name) DO UPDATE SET ext = excluded.ext, is_dir = excluded.is_dir,"
-      " size = excluded.size, mtime = excluded.mtime, kind = excluded.kind, folder = excluded.folder");
-  if (statement == nullptr) return false;
-  statement->Bind(entry.parent)
+      "?, ?) ON CONFLICT(parent, name) DO NOTHING");
+  if (insert == nullptr) return false;
+  const std::string ext = entry.isDir ? std::string() : ExtensionOf(entry.name);
+  insert->Bind(entry.parent)
       .Bind(entry.name)
-      .Bind(entry.isDir ? std::string() : ExtensionOf(entry.name))
+      .Bind(ext)
       .Bind(static_cast<std::int64_t>(entry.isDir))
       .Bind(entry.size)
       .Bind(entry.mtime)
       .Bind(static_cast<std::int64_t>(entry.kind))
       .Bind(entry.folder);
-  return statement->Step() == SQLITE_DONE || Fail("put");
+  if (insert->Step() != SQLITE_DONE) return Fail("put");
+  if (sqlite3_changes(m_db) == 1) {
+    const std::int64_t id = sqlite3_last_insert_rowid(m_db);
+    Statement* name = Prepare("INSERT INTO names(rowid, name) VALUES (?, ?)");
+    if (name == nullptr) return false;
+    return name->Bind(id).Bind(entry.name).Step() == SQLITE_DONE || Fail("put");
+  }
+  Statement* update = Prepare(
+      "UPDATE entries SET ext = ?, is_dir = ?, size = ?, mtime = ?, kind = ?, folder = ?"
+      " WHERE parent = ? AND name = ?");
+  if (update == nullptr) return false;
+  update->Bind(ext)
+      .Bind(static_cast<std::int64_t>(entry.isDir))
+      .Bind(entry.size)
+      .Bind(entry.mtime)
+      .Bind(static_cast<std::int64_t>(entry.kind))
+      .Bind(entry.folder)
+      .Bind(entry.parent)
+      .Bind(entry.name);
+  return update->Step() == SQLITE_DONE || Fail("put");
+}
+
+bool IndexWriter::UnindexName(std::int64_t id, const std::string& name) {
+  Statement* statement = Prepare("INSERT INTO names(names, rowid, name) VALUES ('delete', ?, ?)");
+  if (statement == nullptr) return false;
+  return statement->Bind(id).Bind(name).Step() == SQLITE_DONE || Fail("remove");
 }
 
 bool IndexWriter::Remove(const std::string& parent, const std::string& name) {
-  Statement* statement = Prepare("DELETE FROM entries WHERE parent = ? AND name = ? RETURNING is_dir");
+  Statement* statement = Prepare("DELETE FROM entries WHERE parent = ? AND name = ? RETURNING id, is_dir");
   if (statement == nullptr) return false;
   int rc = statement->Bind(parent).Bind(name).Step();
-  bool wasDir = rc == SQLITE_ROW && statement->Int(0) != 0;
+  const bool found = rc == SQLITE_ROW;
+  const std::int64_t id = found ? statement->Int(0) : 0;
+  const bool wasDir = found && statement->Int(1) != 0;
   while (rc == SQLITE_ROW) rc = statement->Step();
   if (rc != SQLITE_DONE) return Fail("remove");
+  if (found && !UnindexName(id, name)) return false;
   return !wasDir || RemoveBelow(JoinPath(parent, name));
 }
 
 bool IndexWriter::RemoveBelow(const std::string& dir) {
-  if (dir.empty()) return Exec("DELETE FROM entries");
+  if (dir.empty()) return Exec("DELETE FROM entries; INSERT INTO names(names) VALUES ('delete-all');");
   // Everything in dir, and in directories whose path begins with dir + "/": a range of
-  // the (parent, name) index, since "0" sorts right after "/".
+  // the (parent, name) index, since "0" sorts right after "/". The names leave the
+  // full-text index row by row first (read back as they go, so a huge subtree needs no
+  // memory), then the rows go in one statement.
+  Statement* rows = Prepare(
+      "SELECT id, name FROM entries WHERE parent = ?1 OR (parent >= ?1 || '/' AND parent < ?1 || '0')");
+  if (rows == nullptr) return false;
+  rows->Bind(dir);
+  int rc;
+  while ((rc = rows->Step()) == SQLITE_ROW) {
+    if (!UnindexName(rows->Int(0), rows->Text(1))) return false;
+  }
+  if (rc != SQLITE_DONE) return Fail("remove below");
   Statement* statement =
       Prepare("DELETE FROM entries WHERE parent = ?1 OR (parent >= ?1 || '/' AND parent < ?1 || '0')");
   if (statement == nullptr) return false;

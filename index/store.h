@@ -134,6 +134,8 @@ class IndexWriter : public Database {
 
  private:
   using Database::Database;
+  // Takes an entry's name out of the full-text index (before or after its row goes).
+  bool UnindexName(std::int64_t id, const std::string& name);
 };
 
 struct Query {
