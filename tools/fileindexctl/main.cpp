@@ -58,7 +58,8 @@ int main(int argc, char** argv) {
   app.fallthrough();
   app.set_version_flag("--version", "fileindexctl " FILEINDEXCTL_VERSION " (libfileindex.so.6.0)");
   app.add_option("--sysroot", options.sysroot,
-                 "System root for every file the library and the platform use (sets FILEINDEX_SYSROOT)");
+                 "System root for every file the library and the platform use (sets FILEINDEX_SYSROOT)")
+      ->type_name("DIR");
   app.add_flag(
       "--json", options.json,
       "Print results and failures as JSON: {\"ok\": true, ...} or {\"ok\": false, \"error\": {...}}");
@@ -67,7 +68,8 @@ int main(int argc, char** argv) {
   app.add_option("-w,--wait", options.waitSeconds,
                  "Seconds to wait for a configuration lock held by another process (0: fail at once)")
       ->capture_default_str()
-      ->check(CLI::Range(0.0, 86400.0));
+      ->check(CLI::Range(0.0, 86400.0))
+      ->type_name("SECONDS");
   app.add_option("--log-level", options.logLevel,
                  "The library's LOG_LEVEL (7 adds the queue writer's debug lines)");
   bool noSyslog = false;
