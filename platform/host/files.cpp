@@ -1,10 +1,12 @@
 // Small file helpers of the host platform. Every descriptor is opened close-on-exec:
 // the library runs programs while it holds its lock files.
 #include <fcntl.h>
+#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 
 #include "host_common.h"
 
@@ -52,28 +54,72 @@ bool WriteAll(int fd, const std::string& content) {
   return true;
 }
 
+// Gives the unnamed (O_TMPFILE) file fd a fresh name beside path. Linking by descriptor
+// needs CAP_DAC_READ_SEARCH; /proc serves other callers.
+bool LinkUnnamed(int fd, const std::string& path, std::string& name) {
+  static const char kLetters[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789";
+  char procPath[64];
+  std::snprintf(procPath, sizeof(procPath), "/proc/self/fd/%d", fd);
+  for (int attempt = 0; attempt < 100; ++attempt) {
+    unsigned char random[6];
+    if (::getrandom(random, sizeof(random), 0) != static_cast<ssize_t>(sizeof(random))) return false;
+    name = path + ".";
+    for (unsigned char r : random) name += kLetters[r % (sizeof(kLetters) - 1)];
+    if (::linkat(fd, "", AT_FDCWD, name.c_str(), AT_EMPTY_PATH) == 0) return true;
+    if (errno != EEXIST && ::linkat(AT_FDCWD, procPath, AT_FDCWD, name.c_str(), AT_SYMLINK_FOLLOW) == 0)
+      return true;
+    if (errno != EEXIST) return false;
+  }
+  return false;
+}
+
 }  // namespace
 
+// The content is written and synced into an unnamed file of the directory (O_TMPFILE) and
+// named only just before the rename, so a process killed while writing leaves nothing
+// behind in the watch-list or service-state directories. Where O_TMPFILE is not
+// available, a named temporary file does the same job with that small risk.
 bool WriteFileAtomic(const std::string& path, const std::string& content, mode_t mode) {
-  std::string tmp = path + ".XXXXXX";
-  int fd = ::mkostemp(&tmp[0], O_CLOEXEC);
-  if (fd < 0) return false;
-  bool ok = ::fchmod(fd, mode) == 0 && WriteAll(fd, content) && ::fsync(fd) == 0;
-  int saved = errno;
-  ok = ::close(fd) == 0 && ok;
-  if (ok && ::rename(tmp.c_str(), path.c_str()) == 0) {
-    int dir = ::open(DirName(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dir >= 0) {
-      ::fsync(dir);
-      ::close(dir);
+  std::string tmp;
+  int fd = ::open(DirName(path).c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, mode);
+  if (fd >= 0) {
+    bool ok =
+        ::fchmod(fd, mode) == 0 && WriteAll(fd, content) && ::fsync(fd) == 0 && LinkUnnamed(fd, path, tmp);
+    int saved = errno;
+    if (::close(fd) != 0 && ok) {
+      saved = errno;
+      ok = false;
     }
-    return true;
+    if (!ok) {
+      if (!tmp.empty()) ::unlink(tmp.c_str());
+      errno = saved;
+      return false;
+    }
+  } else {
+    tmp = path + ".XXXXXX";
+    fd = ::mkostemp(&tmp[0], O_CLOEXEC);
+    if (fd < 0) return false;
+    bool ok = ::fchmod(fd, mode) == 0 && WriteAll(fd, content) && ::fsync(fd) == 0;
+    int saved = errno;
+    ok = ::close(fd) == 0 && ok;
+    if (!ok) {
+      ::unlink(tmp.c_str());
+      errno = saved;
+      return false;
+    }
   }
-  if (!ok) errno = saved;
-  saved = errno;
-  ::unlink(tmp.c_str());
-  errno = saved;
-  return false;
+  if (::rename(tmp.c_str(), path.c_str()) != 0) {
+    int saved = errno;
+    ::unlink(tmp.c_str());
+    errno = saved;
+    return false;
+  }
+  int dir = ::open(DirName(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (dir >= 0) {
+    ::fsync(dir);
+    ::close(dir);
+  }
+  return true;
 }
 
 bool MakeDirs(const std::string& path, mode_t mode) {
