@@ -152,8 +152,9 @@ queues
 watches
 ctl status
 
-step "Failures name their error code and show the library's log lines"
+step "Failures say in one line what failed and why; -v adds the library's log lines"
 ctl folders get /photo/2019
+ctl -v folders get /photo/2019
 ctl folders add /nowhere/x
 
 printf '\n%sDone.%s The probe is stopped and the sandbox removed on exit.\n' "$BOLD" "$OFF"
