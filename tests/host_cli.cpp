@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <json/json.h>
 #include <sys/file.h>
+#include <sys/mount.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -280,6 +281,22 @@ TEST_F(CliTest, ExitCodesAndJsonErrors) {
             std::string::npos)
       << error;
   EXPECT_EQ(RunJson({"folders", "list"})["folder"].size(), 2u);
+}
+
+// A save that fails says which file and the system's reason.
+TEST_F(CliTest, SaveFailureNamesFileAndCause) {
+  ASSERT_EQ(Run({"folders", "add", "/photo/2019"}).status, 0);
+  const std::string dir = root_ + "/usr/tavo/etc/fileindex";
+  const std::string saved = ReadFile(dir + "/folder.conf");
+  if (::mount("tmpfs", dir.c_str(), "tmpfs", 0, "size=64k") != 0) GTEST_SKIP() << "cannot mount a tmpfs";
+  std::ofstream(dir + "/folder.conf") << saved;
+  std::ofstream(dir + "/fill") << std::string(64 * 1024, 'x');
+  Result full = Run({"folders", "add", "/photo/2020"});
+  ::umount2(dir.c_str(), MNT_DETACH);
+  EXPECT_EQ(full.status, 1);
+  EXPECT_NE(full.err.find("add /photo/2020: cannot save " + dir + "/folder.conf: No space left on device"),
+            std::string::npos)
+      << full.err;
 }
 
 // Status puts what needs attention first and shows folders that may not be indexed.

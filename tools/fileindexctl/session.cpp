@@ -211,10 +211,16 @@ void Session::Explain(Failure& failure, const std::string& what, int savedErrno)
       reason = problems.empty() ? "the configuration cannot be read" : problems.front();
       break;
     }
-    case FI::FILEINDEX_ERR_SAVE_CONFIG:
+    case FI::FILEINDEX_ERR_SAVE_CONFIG: {
       reason = "cannot save the configuration";
+      static const std::string kMarker = "Failed to save json to ";
+      for (const std::string& line : failure.log) {
+        std::string::size_type at = line.find(kMarker);
+        if (at != std::string::npos) reason = "cannot save " + line.substr(at + kMarker.size());
+      }
       if (savedErrno != 0) reason += std::string(": ") + std::strerror(savedErrno);
       break;
+    }
     case FI::FILEINDEX_ERR_NO_SUCH_FOLDER:
       reason = "no such folder";
       break;
