@@ -1,12 +1,15 @@
 // Small file helpers of the host platform. Every descriptor is opened close-on-exec:
 // the library runs programs while it holds its lock files.
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cctype>
 #include <cerrno>
 #include <cstdio>
+#include <ctime>
 
 #include "host_common.h"
 
@@ -73,13 +76,38 @@ bool LinkUnnamed(int fd, const std::string& path, std::string& name) {
   return false;
 }
 
+// Removes the temporary files of path ("path.XXXXXX") that a writer killed between naming
+// and renaming one left behind. A live writer's name is younger than a second or two (its
+// link or its last write changed the inode just before), so only older ones go.
+void SweepTemporaries(const std::string& path) {
+  const std::string dir = DirName(path);
+  const std::string base = path.substr(path.rfind('/') + 1) + ".";
+  DIR* d = ::opendir(dir.c_str());
+  if (d == nullptr) return;
+  const time_t now = ::time(nullptr);
+  while (dirent* entry = ::readdir(d)) {
+    const std::string name = entry->d_name;
+    if (name.size() != base.size() + 6 || name.compare(0, base.size(), base) != 0) continue;
+    bool temporary = true;
+    for (size_t i = base.size(); i < name.size(); ++i)
+      temporary = temporary && std::isalnum(static_cast<unsigned char>(name[i]));
+    struct stat st;
+    const std::string full = dir + "/" + name;
+    if (temporary && ::lstat(full.c_str(), &st) == 0 && S_ISREG(st.st_mode) && now - st.st_ctime >= 2)
+      ::unlink(full.c_str());
+  }
+  ::closedir(d);
+}
+
 }  // namespace
 
 // The content is written and synced into an unnamed file of the directory (O_TMPFILE) and
 // named only just before the rename, so a process killed while writing leaves nothing
-// behind in the watch-list or service-state directories. Where O_TMPFILE is not
-// available, a named temporary file does the same job with that small risk.
+// behind in the watch-list or service-state directories; one killed in the instant between
+// naming and renaming leaves a temporary file that the next write of the same file sweeps
+// away. Where O_TMPFILE is not available, a named temporary file does the same job.
 bool WriteFileAtomic(const std::string& path, const std::string& content, mode_t mode) {
+  SweepTemporaries(path);
   std::string tmp;
   int fd = ::open(DirName(path).c_str(), O_TMPFILE | O_WRONLY | O_CLOEXEC, mode);
   if (fd >= 0) {

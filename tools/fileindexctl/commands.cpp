@@ -162,6 +162,12 @@ bool ReadFolders(std::map<std::string, Json::Value>& out) {
   return true;
 }
 
+std::string Join(const std::vector<std::string>& items) {
+  std::string text;
+  for (const std::string& item : items) text += (text.empty() ? "" : " ") + item;
+  return text;
+}
+
 // Refuses paths that are (or are not) configured folders.
 bool CheckConfigured(Session& session, const std::vector<std::string>& paths, bool wanted) {
   std::map<std::string, Json::Value> folders;
@@ -193,12 +199,6 @@ bool NormalisePaths(Session& session, const std::vector<std::string>& given, std
     out.push_back(normal);
   }
   return true;
-}
-
-std::string Join(const std::vector<std::string>& items) {
-  std::string text;
-  for (const std::string& item : items) text += (text.empty() ? "" : " ") + item;
-  return text;
 }
 
 Json::Value StringArray(const std::vector<std::string>& items) {

@@ -55,6 +55,7 @@ bool ReadDocument(const std::string& path, Json::Value& document, std::vector<st
   std::string errors;
   if (!ParseJson(text.str(), document, errors)) {
     std::string first = errors.substr(0, errors.find('\n'));
+    if (first.compare(0, 2, "* ") == 0) first.erase(0, 2);
     problems.push_back(BaseName(path) + ": not valid JSON (" + (text.str().empty() ? "empty file" : first) +
                        ")");
     return false;

@@ -109,7 +109,7 @@ const char* ErrorName(int code) {
 }
 
 void Session::WaitNotice() {
-  if (noticed_ || options_.json) return;
+  if (noticed_) return;
   noticed_ = true;
   std::string holder = LockHolder();
   std::fprintf(stderr, "fileindexctl: waiting for the configuration lock (%s) for up to %g s\n",
