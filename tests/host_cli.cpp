@@ -111,6 +111,20 @@ TEST_F(CliTest, AddListRemoveRoundTrip) {
   EXPECT_NE(ReadFile(root_ + "/etc/samba/smb.conf").find("\tspotlight = no\n"), std::string::npos);
 }
 
+// Pause, status and path queries answer in JSON; a "no" answer exits 3 and names the rule.
+TEST_F(CliTest, JsonOutputIsJson) {
+  ASSERT_EQ(Run({"folders", "add", "/photo/2019"}).status, 0);
+  EXPECT_TRUE(RunJson({"pause", "2"})["resume_time"].isInt64());
+  EXPECT_EQ(RunJson({"status"})["folders"][0]["status"], "paused");
+  Result link = Run({"--json", "path", "can-index", "/photo/latest"});
+  Json::Value answer;
+  EXPECT_EQ(link.status, 3);
+  ASSERT_TRUE(ParseJson(link.out, answer)) << link.out;
+  EXPECT_EQ(answer["can be indexed"], false);
+  EXPECT_EQ(answer["rule"], "a symbolic link to /photo/2020");
+  EXPECT_EQ(RunJson({"path", "skip", root_ + "/volume1/photo/#recycle/deleted.jpg"})["skipped"], true);
+}
+
 // A held lock is waited for, named, and given up on with exit 75; usage errors exit 2.
 TEST_F(CliTest, LockIsWaitedForThenGivenUpOn) {
   int fd = ::open((root_ + "/tmp/fileidx_cfg_folder.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);

@@ -111,7 +111,7 @@ std::string IndexRule(const std::string& sharePath) {
     std::string target = ::realpath(full.c_str(), resolved) != nullptr ? resolved : "";
     if (target.compare(0, shareDir.size() + 1, shareDir + "/") != 0 && target != shareDir)
       return "a symbolic link leaving the share";
-    return "a symbolic link (to /" + share + target.substr(shareDir.size()) + ")";
+    return "a symbolic link to /" + share + target.substr(shareDir.size());
   }
   if (!S_ISDIR(st.st_mode)) return "not a directory";
   if (FI::CanPathBeIndexed(sharePath)) return "";
