@@ -335,13 +335,16 @@ void AddFolderCommands(CLI::App& app, Action& action) {
       std::vector<std::string> paths;
       for (const Json::Value& record : records) paths.push_back(record["path"].asString());
       if (!CheckConfigured(s, paths, !adding)) return s.Finish(Json::Value(), nullptr);
-      if (adding && !fields->force) {
-        for (const std::string& path : paths) {
-          std::string rule = IndexRule(path);
-          if (rule.empty()) continue;
-          s.Fail(path, "may not be indexed: " + rule + " (--force adds it anyway)", "NOT_INDEXABLE");
+      for (const std::string& path : paths) {
+        // A folder of a share that does not exist cannot be added, forced or not.
+        if (!ShareExists(ShareOf(path))) {
+          s.Fail(path, "no such share \"" + ShareOf(path) + "\"", "NO_SUCH_SHARE");
           return s.Finish(Json::Value(), nullptr);
         }
+        std::string rule = adding && !fields->force ? IndexRule(path) : "";
+        if (rule.empty()) continue;
+        s.Fail(path, "may not be indexed: " + rule + " (--force adds it anyway)", "NOT_INDEXABLE");
+        return s.Finish(Json::Value(), nullptr);
       }
       // Saved means every record is in folder.conf with the fields asked for.
       std::map<std::string, Json::Value> stored;
