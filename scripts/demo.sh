@@ -138,8 +138,9 @@ ctl path can-index '/photo/#recycle'
 ctl path can-index /photo/latest
 ctl share can-index vault
 
-step "Failures name their error code and show the library's log lines"
+step "Failures say in one line what failed and why; -v adds the library's log lines"
 ctl folders get /photo/nowhere
+ctl -v folders get /photo/nowhere
 ctl folders add /nowhere/x
 
 printf '\n%sDone.%s The daemons are stopped and the sandbox removed on exit.\n' "$BOLD" "$OFF"

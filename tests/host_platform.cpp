@@ -3,9 +3,14 @@
 #include <gtest/gtest.h>
 #include <sched.h>
 #include <sys/mount.h>
+#include <sys/wait.h>
 #include <tavo/platform.h>
+#include <tavo/tavotifyd.h>
+#include <unistd.h>
 
+#include <chrono>
 #include <climits>
+#include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
@@ -136,6 +141,47 @@ TEST_F(HostPlatformTest, UnicodeComparisonFoldsCase) {
   EXPECT_LT(VLIBCUnicodeUTF8StrCaseCmp("ab", "ABC"), 0);
   EXPECT_LT(VLIBCUnicodeUTF8StrCaseCmp("é", "F"), 0);
   EXPECT_LT(VLIBCUnicodeUTF8StrCaseCmp("e", "é"), 0);
+}
+
+// Watch lists and service states are written through an unnamed file: a writer killed at
+// any moment leaves the old or the new file, and at most a temporary file that the next
+// write of the same file removes.
+TEST_F(HostPlatformTest, KilledWritersLeaveNoTemporaryFiles) {
+  Json::Value watch;
+  watch["queue"] = root_ + "/volume1/photo/@eaDir/queue";
+  for (int i = 0; i < 5000; ++i) {  // a long list, so that kills land inside writes
+    Json::Value entry;
+    entry["path"] = root_ + "/volume1/photo/folder" + std::to_string(i);
+    entry["mask"] = 4095;
+    watch["config"].append(entry);
+  }
+  const TAVO::TAVOTIFYD::MonitorQueue queue(watch);
+  for (int round = 0; round < 20; ++round) {
+    pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      for (;;) {  // odd rounds write service states only, so that each kind gets written
+        if (round % 2 == 0)
+          TAVO::TAVOTIFYD::MonitorQueue::Upsert(queue, "fileindex",
+                                                TAVO::TAVOTIFYD::_tag_monitor_queue_type_{});
+        VLIBServiceStart("fileindexd", 0);
+        VLIBServiceStop("fileindexd", 0);
+      }
+    }
+    ::usleep(30000 + 3000 * round);
+    ::kill(child, SIGKILL);
+    ::waitpid(child, nullptr, 0);
+  }
+  ::sleep(2);  // leftovers of the last instants are old enough to be swept by the next write
+  TAVO::TAVOTIFYD::MonitorQueue::Upsert(queue, "fileindex", TAVO::TAVOTIFYD::_tag_monitor_queue_type_{});
+  VLIBServiceStop("fileindexd", 0);  // writes its state whatever it was
+  std::vector<std::string> files;
+  for (const char* dir : {"/run/tavotifyd", "/run/tavo/service"}) {
+    ASSERT_TRUE(fs::is_directory(root_ + dir)) << dir;
+    for (const auto& entry : fs::recursive_directory_iterator(root_ + dir))
+      if (!entry.is_directory()) files.push_back(entry.path().filename());
+  }
+  EXPECT_EQ(files, (std::vector<std::string>{"queue.json", "fileindexd"}));
 }
 
 }  // namespace

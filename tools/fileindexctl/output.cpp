@@ -106,11 +106,20 @@ std::string Duration(long long seconds) {
   return std::to_string(minutes / 60) + "h " + std::to_string(minutes % 60) + "m";
 }
 
+std::string InDuration(long long seconds) {
+  if (seconds < 60) return "in " + std::to_string(seconds) + " s";
+  long long minutes = (seconds + 59) / 60;
+  if (minutes < 60) return "in " + std::to_string(minutes) + " min";
+  long long hours = minutes / 60;
+  if (hours < 48) return "in " + std::to_string(hours) + " h " + std::to_string(minutes % 60) + " min";
+  return "in " + std::to_string(hours / 24) + " d " + std::to_string(hours % 24) + " h";
+}
+
 std::string DescribePause(long long resume_time, long long now) {
   if (resume_time == 0) return "paused until resumed";
   if (resume_time == -1) return "not paused";
   if (resume_time > now)
-    return "paused until " + LocalTime(resume_time) + " (" + Duration(resume_time - now) + " left)";
+    return "paused until " + LocalTime(resume_time) + " (" + InDuration(resume_time - now) + ")";
   if (resume_time > 0) return "pause ended at " + LocalTime(resume_time);
   return "not paused (resume time " + std::to_string(resume_time) + ")";
 }

@@ -32,6 +32,8 @@ bool ParseJson(const std::string& text, Json::Value& out, std::string& errors);
 std::string LocalTime(long long epoch);
 // "1h 59m", "3m", "45s"
 std::string Duration(long long seconds);
+// "in 2 h 10 min", "in 5 min", "in 3 d 4 h"
+std::string InDuration(long long seconds);
 // One line on the pause state, from the stored resume time.
 std::string DescribePause(long long resume_time, long long now);
 

@@ -49,7 +49,7 @@ int Search(Session& s, const SearchArgs& args) {
     query.anyKind = false;
     if (!fileindex_store::KindFromName(args.kind, query.kind) ||
         query.kind == fileindex_store::Kind::kOther) {
-      s.Fail("search", "--kind must be document, audio, video or photo, not \"" + args.kind + "\"");
+      s.Usage("--kind must be document, audio, video or photo, not \"" + args.kind + "\"");
       return s.Finish(Json::Value(), nullptr);
     }
   }
