@@ -55,7 +55,10 @@ inline bool LiesIn(const char* path, size_t size, const std::string& folderSlash
   const size_t n = folderSlash.size() - 1;
   // The byte after the folder's length rules out most paths before the comparison.
   if (size < n || (size > n && path[n] != '/')) return false;
-  return n == 0 || std::memcmp(path, folderSlash.data(), n) == 0;
+  if (n == 0) return true;
+  // Sibling folders differ mostly in their last name's last byte: checked before the
+  // whole comparison, which is an out-of-line call.
+  return path[n - 1] == folderSlash[n - 1] && std::memcmp(path, folderSlash.data(), n) == 0;
 }
 
 bool QueuePresent(const std::string& queuePath) {
