@@ -98,15 +98,14 @@ TEST(FolderConfViewTest, AgreesWithTheStrictParseWhereverItDecides) {
       R"({"/a":{},"/a/":{},"/b":[],"/b\u0000":{},"/\u00e9":{}, "/b":{}})",
       R"({"/x":{"d":123456789012345678,"e":1.5,"f":1e3,"g":01,"h":"\ud800\u0041","i":"\ud800"}})",
       "{\"/z\":{\"a\":{\"b\":{\"c\":[[[true]]]}}},\"/\xc3\xa9\xff\":{\"name\":\"\xe2\x82\xac\"}}"};
+  const std::vector<std::string> kInserted{
+      "\"", "{", "}", "[",  "]",    ",",   ":",     "\\",  " ",         "0",
+      "-",  "e", "/", "\n", "\x01", "\\u", "//x\n", "1.5", "\"/\":{},", std::string(1, '\0')};
   std::vector<std::string> texts = seeds;
   for (const std::string& s : seeds)
     for (size_t i = 0; i < s.size(); ++i) {
       texts.push_back(s.substr(0, i) + s.substr(i + 1));
-      for (const char* add :
-           {"\"",  "{",     "}",   "[",        "]", ",",  ":",    "\\",
-            " ",   "0",     "-",   "e",        "/", "\n", "\x01", std::string(1, '\0').c_str(),
-            "\\u", "//x\n", "1.5", "\"/\":{},"})
-        texts.push_back(s.substr(0, i) + (*add ? std::string(add) : std::string(1, '\0')) + s.substr(i));
+      for (const std::string& add : kInserted) texts.push_back(s.substr(0, i) + add + s.substr(i));
     }
   texts.push_back("{" + std::string(70, '[') + std::string(70, ']') + "}");
   texts.push_back("{\"/d\":" + std::string(70, '[') + std::string(70, ']') + "}");
