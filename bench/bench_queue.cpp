@@ -6,6 +6,7 @@
 #include <fileindex/utils.h>
 #include <unistd.h>
 
+#include <cstring>
 #include <memory>
 #include <string>
 
@@ -147,6 +148,37 @@ void ReadFileOnly(benchmark::State& state) {
   Finish(state, env);
 }
 
+// Reading the file and counting its lines: what a scan that looks at every byte once
+// could at best reach.
+void ReadCountLines(benchmark::State& state) {
+  QueueEnv& env = CleanQueue();
+  Prepare(state, env);
+  std::unique_ptr<char[]> buffer(new char[1 << 20]);
+  for (auto _ : state) {
+    int fd = ::open(env.queue.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
+      state.SkipWithError("cannot open the queue");
+      break;
+    }
+    size_t lines = 0;
+    ssize_t n;
+    while ((n = ::read(fd, buffer.get(), 1 << 20)) > 0) {
+      const char* p = buffer.get();
+      const char* const end = p + n;
+      while ((p = static_cast<const char*>(std::memchr(p, '\n', static_cast<size_t>(end - p)))) != nullptr) {
+        ++lines;
+        ++p;
+      }
+    }
+    ::close(fd);
+    if (lines != env.stats.lines + 1) {
+      state.SkipWithError("wrong line count");
+      break;
+    }
+  }
+  Finish(state, env);
+}
+
 // The library's line splitting alone.
 void LineReaderOnly(benchmark::State& state) {
   QueueEnv& env = CleanQueue();
@@ -175,6 +207,7 @@ void RegisterQueueBenchmarks() {
   realTime(benchmark::RegisterBenchmark("pending_reindex/library", PendingReindexLibrary));
   realTime(benchmark::RegisterBenchmark("pending_reindex/baseline", PendingReindexBaseline));
   realTime(benchmark::RegisterBenchmark("read_file_only/reference", ReadFileOnly));
+  realTime(benchmark::RegisterBenchmark("read_count_lines/reference", ReadCountLines));
   realTime(benchmark::RegisterBenchmark("line_reader_only/reference", LineReaderOnly));
 }
 

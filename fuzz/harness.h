@@ -39,6 +39,7 @@
 #include <thread>
 #include <vector>
 
+#include "internal/folder_conf_view.h"
 #include "internal/json_io.h"
 #include "internal/queue_scan.h"
 #if __has_include("internal/queue_line_view.h")
@@ -441,6 +442,53 @@ inline std::string CheckFolderConf(const Env& env, const uint8_t* data, size_t s
     }
     std::string problem = CheckPage(result, all.size(), offset, limit, sortBy, direction);
     if (!problem.empty()) return problem + " for " + Show(text);
+  }
+  return std::string();
+}
+
+// The fast reader of folder.conf against the strict parse, and every path query answered
+// through it against the same query over the folders of a full load: the same answer,
+// log lines and error code.
+inline std::string CheckFolderConfView(const Env& env, const uint8_t* data, size_t size) {
+  ResetState(env);
+  const std::string text(reinterpret_cast<const char*>(data), size);
+  std::vector<fi::internal::FolderConfName> names;
+  if (fi::internal::ViewFolderConf(text.data(), text.size(), names)) {
+    Json::Value doc;
+    if (!fi::internal::JsonFromString(doc, text) || !doc.isObject())
+      return "the fast reader decides what the strict parse refuses: " + Show(text);
+    std::vector<std::string> viewed;
+    for (const auto& name : names) viewed.emplace_back(name.data, name.size);
+    if (viewed != doc.getMemberNames()) return "the fast reader lists other names: " + Show(text);
+  }
+  WriteBytes(env.FolderConf(), text);
+  std::vector<std::string> probes{"/photo/a", "/photo/a/b/c", "/video", "/", ""};
+  if (!names.empty()) probes.emplace_back(std::string(names.back().data, names.back().size) + "/x");
+  for (const std::string& probe : probes) {
+    std::string answers[2];
+    for (int full = 0; full < 2; ++full) {
+      for (int i = 0; i < 3; ++i) {
+        fi::ErrorHandler::g_error_code = fi::FILEINDEX_ERR_NONE;
+        logcap::Clear();
+        bool answer;
+        if (full == 0) {
+          answer = i == 0   ? fi::IndexMgr::IsPathIndexed(probe)
+                   : i == 1 ? fi::IndexMgr::IsFullPathIndexed(env.Full(probe))
+                            : fi::IndexMgr::IsPathContainIndexed(probe);
+        } else {
+          std::vector<fi::Folder> folders;
+          answer = fi::IndexMgr::List(folders) && !folders.empty() &&
+                   (i == 0   ? fi::IndexMgr::IsPathIndexed(probe, folders)
+                    : i == 1 ? fi::IndexMgr::IsFullPathIndexed(env.Full(probe), folders)
+                             : fi::IndexMgr::IsPathContainIndexed(probe, folders));
+        }
+        answers[full] += std::to_string(answer) + " " + std::to_string(fi::ErrorHandler::GetError()) + "\n";
+        for (const std::string& line : logcap::Texts()) answers[full] += line + "\n";
+      }
+    }
+    if (answers[0] != answers[1])
+      return "a query differs from the full load for " + Show(probe) + ": " + Show(answers[0]) + " vs " +
+             Show(answers[1]) + " on " + Show(text);
   }
   return std::string();
 }

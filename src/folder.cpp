@@ -2,6 +2,7 @@
 #include <fileindex/folder.h>
 #include <fileindex/utils.h>
 
+#include "internal/full_path_resolver.h"
 #include "internal/log.h"
 
 namespace TAVO {
@@ -9,7 +10,22 @@ namespace FILEINDEX {
 
 namespace {
 const char kLogUnit[] = "folder";
+// The source line of this message is fixed: log watchers match it.
+const int kRetryFullPathLine = 61;
 }  // namespace
+
+namespace internal {
+
+std::string RetryFullPath(const std::string& path) {
+  std::string full;
+  if (!::TAVO::FILEINDEX::GetFullPath(full, path)) {
+    FIDX_LOG_AT(kRetryFullPathLine, "Failed to get full path from %s", path.c_str());
+    return std::string();
+  }
+  return full;
+}
+
+}  // namespace internal
 
 Folder::Folder() : m_blDocument(false), m_blAudio(false), m_blVideo(false), m_blPhoto(false) {}
 
@@ -54,14 +70,7 @@ bool Folder::AddToJson(Json::Value& container) const {
 
 std::string Folder::GetFullPath() const {
   if (!m_strFullPath.empty()) return m_strFullPath;
-  // Not stored (the share was unknown when the folder was loaded): try again now, so a
-  // share that has come back is found.
-  std::string full;
-  if (!::TAVO::FILEINDEX::GetFullPath(full, m_strPath)) {
-    FIDX_LOG("Failed to get full path from %s", m_strPath.c_str());
-    return std::string();
-  }
-  return full;
+  return internal::RetryFullPath(m_strPath);
 }
 
 bool Folder::SetPath(const std::string& path) {

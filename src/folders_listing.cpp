@@ -5,6 +5,8 @@
 #include <algorithm>
 #include <vector>
 
+#include "internal/listing_pass.h"
+
 namespace TAVO {
 namespace FILEINDEX {
 
@@ -72,7 +74,13 @@ bool Folders::List(Json::Value& result, unsigned long offset, unsigned long limi
   // end of the list; such a page is empty instead, in either direction.
   if (offset <= total) {
     const unsigned long n = std::min(total - offset, limit);
-    if (sort_direction == "DESC") {
+    const bool descending = sort_direction == "DESC";
+    // The page's fields share one read of status.conf and of each queue file.
+    std::vector<std::string> paths;
+    paths.reserve(n);
+    for (unsigned long i = 0; i < n; ++i) paths.push_back(sorted[descending ? i : offset + i]->GetPath());
+    internal::ListingPass pass(std::move(paths));
+    if (descending) {
       // A descending page is the first n folders of the ascending order, reversed: the
       // offset does not apply here.
       for (unsigned long i = n; i > 0; --i) page.append(sorted[i - 1]->asJson(additional));

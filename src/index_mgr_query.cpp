@@ -5,6 +5,9 @@
 #include <fileindex/index_mgr.h>
 #include <fileindex/utils.h>
 
+#include "internal/folder_conf_view.h"
+#include "internal/full_path_resolver.h"
+#include "internal/json_io.h"
 #include "internal/log.h"
 #include "internal/scope_exit.h"
 
@@ -21,6 +24,35 @@ bool LiesIn(const std::string& inner, const std::string& outer) {
   if (inner.size() < outer.size() || inner.compare(0, outer.size(), outer) != 0) return false;
   return inner.size() == outer.size() || inner[outer.size()] == '/';
 }
+
+// The folders' paths as a load of folder.conf lists them, read by the fast reader
+// without building the document or the folders, each resolved to its full path as the
+// load resolves it: the same platform calls, error codes and log lines, in the same
+// order. Nothing is kept between calls.
+struct QuickFolders {
+  std::vector<std::string> paths;
+  std::vector<std::string> fulls;  // when asked for; empty for a share that is not known
+
+  // False when the fast reader leaves the file to the load (a missing file included).
+  bool Read(bool wantFulls) {
+    const std::string confPath = Folders().GetPath();
+    std::string text;
+    std::vector<internal::FolderConfName> names;
+    if (!IsFileExist(confPath) || !internal::ReadWholeFile(confPath, text) ||
+        !internal::ViewFolderConf(text.data(), text.size(), names))
+      return false;
+    internal::FullPathResolver resolver;
+    paths.reserve(names.size());
+    if (wantFulls) fulls.reserve(names.size());
+    for (const internal::FolderConfName& name : names) {
+      paths.emplace_back(name.data, name.size);
+      std::string full;
+      resolver.Resolve(full, paths.back());
+      if (wantFulls) fulls.push_back(std::move(full));
+    }
+    return true;
+  }
+};
 }  // namespace
 
 bool IndexMgr::List(std::vector<Folder>& folders) {
@@ -31,6 +63,13 @@ bool IndexMgr::List(std::vector<Folder>& folders) {
 }
 
 bool IndexMgr::IsPathIndexed(const std::string& path) {
+  QuickFolders quick;
+  if (quick.Read(false)) {
+    for (const std::string& folder : quick.paths) {
+      if (LiesIn(path, folder)) return true;
+    }
+    return false;
+  }
   std::vector<Folder> folders;
   if (!List(folders) || folders.empty()) return false;
   return IsPathIndexed(path, folders);
@@ -44,6 +83,15 @@ bool IndexMgr::IsPathIndexed(const std::string& path, const std::vector<Folder>&
 }
 
 bool IndexMgr::IsFullPathIndexed(const std::string& full) {
+  QuickFolders quick;
+  if (quick.Read(true)) {
+    for (size_t i = 0; i < quick.fulls.size(); ++i) {
+      // As Folder::GetFullPath: a path not resolved at load is tried again.
+      if (LiesIn(full, quick.fulls[i].empty() ? internal::RetryFullPath(quick.paths[i]) : quick.fulls[i]))
+        return true;
+    }
+    return false;
+  }
   std::vector<Folder> folders;
   if (!List(folders) || folders.empty()) return false;
   return IsFullPathIndexed(full, folders);
@@ -57,6 +105,13 @@ bool IndexMgr::IsFullPathIndexed(const std::string& full, const std::vector<Fold
 }
 
 bool IndexMgr::IsPathContainIndexed(const std::string& path) {
+  QuickFolders quick;
+  if (quick.Read(false)) {
+    for (const std::string& folder : quick.paths) {
+      if (LiesIn(folder, path)) return true;
+    }
+    return false;
+  }
   std::vector<Folder> folders;
   if (!List(folders) || folders.empty()) return false;
   return IsPathContainIndexed(path, folders);
@@ -70,12 +125,19 @@ bool IndexMgr::IsPathContainIndexed(const std::string& path, const std::vector<F
 }
 
 bool IndexMgr::IsShareIndexed(const std::string& share) {
-  std::vector<Folder> folders;
-  if (!List(folders) || folders.empty()) return false;
-  for (const Folder& folder : folders) {
+  QuickFolders quick;
+  std::vector<std::string> paths;
+  if (quick.Read(false)) {
+    paths.swap(quick.paths);
+  } else {
+    std::vector<Folder> folders;
+    if (!List(folders)) return false;
+    for (const Folder& folder : folders) paths.push_back(folder.GetPath());
+  }
+  for (const std::string& path : paths) {
     std::string name;
-    if (!GetShareNameByPath(name, folder.GetPath())) {
-      FIDX_LOG("Failed to get share name from path: %s", folder.GetPath().c_str());
+    if (!GetShareNameByPath(name, path)) {
+      FIDX_LOG("Failed to get share name from path: %s", path.c_str());
       continue;
     }
     if (name == share) return true;

@@ -8,7 +8,9 @@
 #include <cstdint>
 #include <ctime>
 #include <functional>
+#include <memory>
 
+#include "internal/listing_pass.h"
 #include "internal/log.h"
 #include "internal/scope_exit.h"
 
@@ -39,6 +41,20 @@ bool LockedWrite(const StatusChange& change, const AfterSave& afterSave = AfterS
 }
 
 bool Read(const std::function<bool(Status&)>& query) {
+  // Within a listing page status.conf is loaded once and shared by every folder's
+  // fields; a load that fails is not kept, so each reader then fails and logs as alone.
+  if (internal::ListingPass* pass = internal::ListingPass::Current()) {
+    if (Status* shared = pass->LoadedStatus()) return query(*shared);
+    if (!pass->StatusTried()) {
+      std::unique_ptr<Status> loaded(new Status);
+      if (!loaded->Load()) {
+        pass->KeepStatus(nullptr);
+        return false;
+      }
+      pass->KeepStatus(std::move(loaded));
+      return query(*pass->LoadedStatus());
+    }
+  }
   Status status;
   if (!status.Load()) return false;
   return query(status);

@@ -5,6 +5,7 @@
 #include <fileindex/status_mgr.h>
 #include <fileindex/utils.h>
 
+#include <cerrno>
 #include <cstdint>
 #include <cstring>
 #include <ctime>
@@ -12,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include "internal/listing_pass.h"
 #include "internal/log.h"
 #include "internal/queue_line_view.h"
 #include "internal/queue_scan.h"
@@ -53,7 +55,10 @@ inline bool LiesIn(const char* path, size_t size, const std::string& folderSlash
   const size_t n = folderSlash.size() - 1;
   // The byte after the folder's length rules out most paths before the comparison.
   if (size < n || (size > n && path[n] != '/')) return false;
-  return n == 0 || std::memcmp(path, folderSlash.data(), n) == 0;
+  if (n == 0) return true;
+  // Sibling folders differ mostly in their last name's last byte: checked before the
+  // whole comparison, which is an out-of-line call.
+  return path[n - 1] == folderSlash[n - 1] && std::memcmp(path, folderSlash.data(), n) == 0;
 }
 
 bool QueuePresent(const std::string& queuePath) {
@@ -67,23 +72,23 @@ bool QueuePathOf(const std::string& share, std::string& queuePath) {
   return true;
 }
 
-// Whether the queue file holds an event inside the folder with this share path. The
-// whole file is always read, so that every malformed line gets its log line.
-bool IsPathInQueue(const std::string& path, const std::string& queuePath) {
-  if (!IsFileExist(queuePath)) return false;
-  std::string full;
-  if (!GetFullPath(full, path)) {
-    FIDX_LOG_AT(kPathInQueueFullPathLine, "Cannot get full path: %s", path.c_str());
-    return false;
-  }
-  const std::string folderSlash = full + "/";
-
-  internal::QueueLineReader reader;
-  if (!reader.Open(queuePath)) {
-    FIDX_LOG_AT(kPathInQueueOpenLine, "Failed to open queue=%s, reason=%m", queuePath.c_str());
-    return false;
-  }
-  bool found = false;
+// Reads every line of an open queue file, marking in found[i] whether an event lies in
+// the folder folderSlashes[i] (a full path followed by "/") and handing each malformed
+// line to malformed. The whole file is always read, so that every malformed line is seen.
+template <typename OnMalformed>
+void ScanQueue(internal::QueueLineReader& reader, const std::vector<std::string>& folderSlashes,
+               std::vector<char>& found, OnMalformed&& malformed) {
+  found.assign(folderSlashes.size(), 0);
+  auto mark = [&](const char* path, size_t size, unsigned code, const char* pathOld, size_t pathOldSize) {
+    for (size_t i = 0; i < folderSlashes.size(); ++i) {
+      if (found[i]) continue;
+      // Another code's old path is not read: it lies in no folder.
+      if (LiesIn(path, size, folderSlashes[i]) ||
+          (code == kRenameEvent && pathOld != nullptr && LiesIn(pathOld, pathOldSize, folderSlashes[i]))) {
+        found[i] = 1;
+      }
+    }
+  };
   internal::QueueEventView view;
   internal::QueueEvent event;
   const char* data;
@@ -95,11 +100,7 @@ bool IsPathInQueue(const std::string& path, const std::string& queuePath) {
       const char* lineEnd = nullptr;
       const internal::QueueLineKind kind = internal::ClassifyQueueLine(line, end, view, lineEnd);
       if (kind == internal::QueueLineKind::kEvent) {
-        if (LiesIn(view.path, view.pathSize, folderSlash) ||
-            (view.event == kRenameEvent && view.pathOld != nullptr &&
-             LiesIn(view.pathOld, view.pathOldSize, folderSlash))) {
-          found = true;
-        }
+        mark(view.path, view.pathSize, view.event, view.pathOld, view.pathOldSize);
       } else {
         lineEnd = static_cast<const char*>(std::memchr(line, '\n', static_cast<size_t>(end - line)));
         if (lineEnd == nullptr) lineEnd = end;
@@ -107,19 +108,102 @@ bool IsPathInQueue(const std::string& path, const std::string& queuePath) {
         // A line the fast reader could not decide goes to the full parser, which has the
         // last word.
         if (kind == internal::QueueLineKind::kNotEvent || !internal::ParseQueueLine(line, lineSize, event)) {
-          FIDX_LOG_AT(kPathInQueueMalformedLine, "Malformed command: %s",
-                      std::string(line, lineSize).c_str());
-        } else if (LiesIn(event.path.data(), event.path.size(), folderSlash) ||
-                   (event.event == kRenameEvent &&
-                    LiesIn(event.pathOld.data(), event.pathOld.size(), folderSlash))) {
-          // Another code's old path reads as empty, which lies in no folder.
-          found = true;
+          malformed(line, lineSize);
+        } else {
+          mark(event.path.data(), event.path.size(), event.event, event.pathOld.data(), event.pathOld.size());
         }
       }
       line = lineEnd < end ? lineEnd + 1 : end;
     }
   }
-  return found;
+}
+
+void LogMalformed(const char* line, size_t size) {
+  FIDX_LOG_AT(kPathInQueueMalformedLine, "Malformed command: %s", std::string(line, size).c_str());
+}
+
+// Malformed lines kept for a page, in bytes; a queue with more is read per folder.
+const size_t kKeptMalformedBytes = 1 << 20;
+
+// The shared read of queuePath for the listing page's folders in the share of path
+// (whose full path is full): each one's full path is the share's volume part followed
+// by its share path, as GetFullPath builds it.
+void ScanForPage(const internal::ListingPass& pass, const std::string& queuePath, const std::string& path,
+                 const std::string& full, internal::SharedQueueScan& scan) {
+  std::vector<std::string> folderSlashes{full + "/"};
+  std::string share;
+  if (full.size() >= path.size() && full.compare(full.size() - path.size(), path.size(), path) == 0 &&
+      GetShareNameByPath(share, path)) {
+    const std::string volume = full.substr(0, full.size() - path.size());
+    for (const std::string& other : pass.Paths()) {
+      std::string otherShare;
+      if (other != path && !other.empty() && GetShareNameByPath(otherShare, other) && otherShare == share)
+        folderSlashes.push_back(volume + other + "/");
+    }
+  }
+  internal::QueueLineReader reader;
+  scan.opened = reader.Open(queuePath);
+  if (!scan.opened) {
+    scan.openErrno = errno;
+    return;
+  }
+  size_t keptBytes = 0;
+  std::vector<char> found;
+  ScanQueue(reader, folderSlashes, found, [&](const char* line, size_t size) {
+    if (!scan.complete) return;
+    keptBytes += size;
+    if (keptBytes > kKeptMalformedBytes) {
+      scan.complete = false;
+      scan.malformed.clear();
+      scan.malformed.shrink_to_fit();
+      return;
+    }
+    scan.malformed.emplace_back(line, size);
+  });
+  for (size_t i = 0; i < folderSlashes.size(); ++i) scan.found[folderSlashes[i]] = found[i] != 0;
+}
+
+// Whether the queue file holds an event inside the folder with this share path. The
+// whole file is always read, so that every malformed line gets its log line; within a
+// listing page the file is read once for all the page's folders, and what each folder's
+// own read would have logged is logged for it.
+bool IsPathInQueue(const std::string& path, const std::string& queuePath) {
+  if (!IsFileExist(queuePath)) return false;
+  std::string full;
+  if (!GetFullPath(full, path)) {
+    FIDX_LOG_AT(kPathInQueueFullPathLine, "Cannot get full path: %s", path.c_str());
+    return false;
+  }
+  const std::string folderSlash = full + "/";
+
+  if (internal::ListingPass* pass = internal::ListingPass::Current()) {
+    internal::SharedQueueScan* scan = pass->FindQueue(queuePath);
+    if (scan == nullptr) {
+      scan = &pass->AddQueue(queuePath);
+      ScanForPage(*pass, queuePath, path, full, *scan);
+    }
+    if (!scan->opened) {
+      errno = scan->openErrno;
+      FIDX_LOG_AT(kPathInQueueOpenLine, "Failed to open queue=%s, reason=%m", queuePath.c_str());
+      return false;
+    }
+    auto it = scan->found.find(folderSlash);
+    // A folder the shared read did not cover (its share changed meanwhile) or a queue
+    // with too many malformed lines to keep is read on its own below.
+    if (it != scan->found.end() && scan->complete) {
+      for (const std::string& line : scan->malformed) LogMalformed(line.data(), line.size());
+      return it->second;
+    }
+  }
+
+  internal::QueueLineReader reader;
+  if (!reader.Open(queuePath)) {
+    FIDX_LOG_AT(kPathInQueueOpenLine, "Failed to open queue=%s, reason=%m", queuePath.c_str());
+    return false;
+  }
+  std::vector<char> found;
+  ScanQueue(reader, {folderSlash}, found, LogMalformed);
+  return found[0] != 0;
 }
 }  // namespace
 

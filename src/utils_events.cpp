@@ -125,8 +125,14 @@ AppendResult AppendLocked(const std::string& queuePath, const std::string& line)
     int fd = OpenQueueForAppend(queuePath);
     if (fd < 0) return AppendResult::kFailed;
     if (::flock(fd, LOCK_EX | LOCK_NB) == 0) {
+      // The length before the write, known under the lock, is where a short write is cut
+      // back to: a fragment left at the end would glue the next event onto it and both
+      // would be lost to every reader.
+      struct stat before;
+      const bool sized = ::fstat(fd, &before) == 0;
       ssize_t written = ::write(fd, line.data(), line.size());
       if (written < 0 || static_cast<size_t>(written) < line.size()) {
+        if (written > 0 && sized) static_cast<void>(::ftruncate(fd, before.st_size));
         FIDX_DEBUG("write fail, (%ld, %ld)", static_cast<long>(written), static_cast<long>(line.size()));
       }
       ::flock(fd, LOCK_UN);

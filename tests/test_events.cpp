@@ -1,11 +1,14 @@
 // Custom events appended to the share queues, and the streaming queue reader.
 #include <fileindex/error.h>
 #include <fileindex/utils.h>
+#include <sched.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstring>
 
 #include "internal/queue_scan.h"
 #include "support/sysroot_test.h"
@@ -118,6 +121,38 @@ TEST_F(EventsTest, QueueScanSplitsLinesAcrossBlocksAtNewlinesOnly) {
   errno = 0;
   EXPECT_FALSE(internal::ForEachQueueLine(queue_ + ".none", collect));
   EXPECT_EQ(errno, ENOENT);
+}
+
+// Guards that a short write on a full volume leaves no fragment behind: every line of the
+// queue stays whole, the call still succeeds and the short write is reported at debug level.
+TEST_F(EventsTest, FullVolumeNeverLeavesAPartialLine) {
+  // In a private mount namespace, so the small tmpfs never shows on the host.
+  if (::unshare(CLONE_NEWNS) != 0 || ::mount("none", "/", "none", MS_REC | MS_PRIVATE, nullptr) != 0 ||
+      ::mount("tmpfs", (dir_ + "/@eaDir").c_str(), "tmpfs", 0, "size=64k") != 0)
+    GTEST_SKIP() << "cannot mount a small tmpfs in a private mount namespace here";
+  LOG_LEVEL = 7;
+  Json::Value data(Json::objectValue);
+  int appended = 0;
+  for (int i = 0; i < 40; ++i) {
+    // Sizes that do not divide a page, so the volume fills part-way through a line.
+    data["pad"] = std::string(2500 + 97 * i, static_cast<char>('a' + i % 26));
+    ASSERT_TRUE(AddCustomEvent(131072, full_ + "/" + std::to_string(i), data));
+    struct stat st;
+    ASSERT_EQ(::stat(queue_.c_str(), &st), 0);
+    const std::string text = ReadFile(queue_);
+    ASSERT_EQ(static_cast<size_t>(st.st_size), text.size());
+    ASSERT_TRUE(text.empty() || text.back() == '\n') << "torn after event " << i;
+    appended = static_cast<int>(ReadLines(queue_).size());
+  }
+  const std::vector<std::string> lines = ReadLines(queue_);
+  EXPECT_TRUE(appended > 5 && appended < 40) << appended;
+  for (size_t i = 0; i < lines.size(); ++i) {
+    const Json::Value line = ParseJson(lines[i]);
+    EXPECT_EQ(line["path"].asString(), full_ + "/" + std::to_string(i));
+    EXPECT_EQ(line["data"]["pad"].asString().size(), 2500 + 97 * i);
+  }
+  EXPECT_GE(logcap::Count(" write fail, ("), 1);
+  ::umount((dir_ + "/@eaDir").c_str());
 }
 
 }  // namespace

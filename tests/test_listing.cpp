@@ -1,11 +1,15 @@
 // The paged, sorted folder listing and the additional fields of each listed folder.
 #include <fileindex/error.h>
 #include <fileindex/folder.h>
+#include <fileindex/folders.h>
 #include <fileindex/index_mgr.h>
 #include <sys/stat.h>
+
 #include <algorithm>
+#include <random>
 #include <string>
 #include <vector>
+
 #include "internal/json_io.h"
 #include "support/sysroot_test.h"
 
@@ -15,7 +19,10 @@ using Strings = std::vector<std::string>;
 namespace {
 class ListingTest : public SysrootTest {
  protected:
-  void SetUp() override { SysrootTest::SetUp(); AddShare("s"); }
+  void SetUp() override {
+    SysrootTest::SetUp();
+    AddShare("s");
+  }
   // Writes folder.conf from (path, name, photo) triples and makes each directory.
   void WriteFolders(const std::vector<std::tuple<std::string, std::string, bool>>& rows) {
     Json::Value conf(Json::objectValue);
@@ -27,7 +34,11 @@ class ListingTest : public SysrootTest {
     WriteFile(FolderConfPath(), conf.toStyledString());
   }
   void WriteFive() {
-    WriteFolders({{"/s/1", "e", true}, {"/s/2", "c", false}, {"/s/3", "A", true}, {"/s/4", "D", false}, {"/s/5", "b", false}});
+    WriteFolders({{"/s/1", "e", true},
+                  {"/s/2", "c", false},
+                  {"/s/3", "A", true},
+                  {"/s/4", "D", false},
+                  {"/s/5", "b", false}});
   }
   Json::Value List(unsigned long offset, unsigned long limit, const std::string& sortBy = "name",
                    const std::string& dir = "ASC", const Json::Value& add = Json::Value(Json::arrayValue)) {
@@ -56,7 +67,8 @@ TEST_F(ListingTest, SortsAndPagesAscendingAndDescending) {
   EXPECT_EQ(Col(List(0, 2, "name", "DESC")), (Strings{"b", "A"}));
   EXPECT_EQ(Col(List(3, 10, "name", "DESC")), (Strings{"b", "A"}));
   EXPECT_EQ(Col(List(0, 2, "name", "desc")), (Strings{"A", "b"}));  // only the exact word
-  for (const Json::Value& page : {List(0, 0), List(5, 10), List(~0UL, ~0UL), List(~0UL, ~0UL, "name", "DESC")}) {
+  for (const Json::Value& page :
+       {List(0, 0), List(5, 10), List(~0UL, ~0UL), List(~0UL, ~0UL, "name", "DESC")}) {
     EXPECT_EQ(page["total"].asUInt64(), 5u);
     EXPECT_EQ(page["folder"], Json::Value(Json::arrayValue));
   }
@@ -118,4 +130,78 @@ TEST_F(ListingTest, UnreadableConfigurationFailsTheListing) {
   EXPECT_FALSE(IndexMgr::List(result, 0, 10, "name", "ASC", Json::Value(Json::arrayValue)));
   EXPECT_EQ(result, Json::Value("untouched"));
   EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_MALFORMED_CONFIG);
+}
+
+// Guards that a page reading each queue and status.conf once gives every folder the
+// answer and the log lines (malformed queue lines once per folder that reads them, in
+// order) that reading them folder by folder gives, across generated queues and states.
+TEST_F(ListingTest, SharedReadsMatchFolderByFolderReads) {
+  AddShare("t");
+  std::vector<std::tuple<std::string, std::string, bool>> rows;
+  for (int i = 0; i < 8; ++i) {
+    rows.emplace_back("/s/d" + std::to_string(i), "n" + std::to_string(i * 5 % 8), i % 2 == 0);
+    rows.emplace_back("/t/d" + std::to_string(i), "m" + std::to_string(i), false);
+  }
+  WriteFolders(rows);
+  const Json::Value names = ParseJson(R"(["status","is_valid"])");
+  const std::string full = Rooted("/volume1"), queueS = full + "/s/@eaDir/TAVO@file_index_queue";
+  const std::string queueT = full + "/t/@eaDir/TAVO@file_index_queue";
+  ::mkdir((full + "/s/@eaDir").c_str(), 0755);
+  ::mkdir((full + "/t/@eaDir").c_str(), 0755);
+  std::mt19937 rng(5);
+  auto queue = [&](const std::string& share, int lines) {
+    std::string text;
+    for (int i = 0; i < lines; ++i) {
+      const std::string path =
+          full + "/" + share + "/d" + std::to_string(rng() % 12) + (rng() % 2 ? "/x" : "");
+      switch (rng() % 6) {
+        case 0:
+          text += "{\"event\":2,\"path\":\"" + path + "\"} x\n";
+          break;  // malformed
+        case 1:
+          text += "{\"event\":256,\"path\":\"/o\",\"path_old\":\"" + path + "\"}\n";
+          break;
+        case 2:
+          text += "{\"event\":\"2\",\"path\":\"" + path + "\"}\n";
+          break;  // malformed
+        default:
+          text += "{\"event\":2,\"path\":\"" + path + "\"}\n";
+      }
+    }
+    return text;
+  };
+  size_t logged = 0, statuses = 0;
+  const std::string manyMalformed = std::string(20000, '!') + "\n";
+  for (int round = 0; round < 12; ++round) {
+    ::unlink(queueS.c_str()), ::unlink((queueS + ".tmp").c_str()), ::unlink(queueT.c_str());
+    if (round % 3 != 2) WriteFile(queueS, queue("s", 1 + round));
+    if (round % 2 == 1) WriteFile(queueS + ".tmp", queue("s", 3));
+    if (round % 4 != 3) WriteFile(queueT, queue("t", 2 + round % 5));
+    if (round == 5) {  // more malformed text than a page keeps
+      std::string big;
+      for (int i = 0; i < 60; ++i) big += manyMalformed;
+      WriteFile(queueT, big + queue("t", 4));
+    }
+    const char* const conf[] = {R"({"resume_time":0})", R"({"no_space":{"t":true}})", "{oops", "{}"};
+    WriteFile(StatusConfPath(), conf[round % 4]);
+    const std::string dir = round % 2 ? "DESC" : "ASC";
+    logcap::Clear();
+    const Json::Value page = List(round % 5, 7 + round % 4, "name", dir, names);
+    const Strings pageLog = logcap::Texts();
+    // The reference: each listed folder's fields computed on their own, in page order.
+    Folders config;
+    std::vector<Folder> folders;
+    ASSERT_TRUE(config.Load() && config.List(folders));
+    logcap::Clear();
+    Json::Value alone(Json::arrayValue);
+    for (const Json::Value& listed : page["folder"]) {
+      for (const Folder& folder : folders)
+        if (folder.GetPath() == listed["path"].asString()) alone.append(folder.asJson(names));
+    }
+    EXPECT_EQ(page["folder"], alone) << "round " << round;
+    EXPECT_EQ(pageLog, logcap::Texts()) << "round " << round;
+    logged += pageLog.size();
+    for (const Json::Value& listed : page["folder"]) statuses += listed["additional"]["status"] != "finished";
+  }
+  EXPECT_TRUE(logged > 100 && statuses > 20) << logged << " " << statuses;
 }

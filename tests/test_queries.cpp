@@ -7,6 +7,12 @@
 #include <sys/file.h>
 #include <unistd.h>
 
+#include <random>
+#include <string>
+#include <vector>
+
+#include "internal/folder_conf_view.h"
+#include "internal/json_io.h"
 #include "support/sysroot_test.h"
 
 using namespace TAVO::FILEINDEX;
@@ -80,4 +86,102 @@ TEST_F(QueriesTest, GetTakesTheLockAndReleasesItOnEveryWayOut) {
   Folders config;
   EXPECT_TRUE(config.Lock(true));  // every call above let go of the lock
   config.Unlock();
+}
+
+// Guards the fast reader of folder.conf: wherever it decides a text, the strict parse
+// must read an object with exactly these member names in this order. Hand-picked texts
+// plus every one-byte deletion and insertion of a delimiter into them.
+TEST(FolderConfViewTest, AgreesWithTheStrictParseWhereverItDecides) {
+  const std::vector<std::string> seeds{
+      R"({"/a/b":{"name":"x","document":true,"audio":false},"/a/c":{"name":"q\"\\\/\b\f\n\r\t\u00e9\ud83d\ude00"}})",
+      "{\n  \"\" : { \"n\" : [ 1, -2, 0, null, { } ] },\r\n\t\"/v\" : {\"path\":\"/v\",\"x\":-0} }\n",
+      R"({"/a":{},"/a/":{},"/b":[],"/b\u0000":{},"/\u00e9":{}, "/b":{}})",
+      R"({"/x":{"d":123456789012345678,"e":1.5,"f":1e3,"g":01,"h":"\ud800\u0041","i":"\ud800"}})",
+      "{\"/z\":{\"a\":{\"b\":{\"c\":[[[true]]]}}},\"/\xc3\xa9\xff\":{\"name\":\"\xe2\x82\xac\"}}"};
+  const std::vector<std::string> kInserted{
+      "\"", "{", "}", "[",  "]",    ",",   ":",     "\\",  " ",         "0",
+      "-",  "e", "/", "\n", "\x01", "\\u", "//x\n", "1.5", "\"/\":{},", std::string(1, '\0')};
+  std::vector<std::string> texts = seeds;
+  for (const std::string& s : seeds)
+    for (size_t i = 0; i < s.size(); ++i) {
+      texts.push_back(s.substr(0, i) + s.substr(i + 1));
+      for (const std::string& add : kInserted) texts.push_back(s.substr(0, i) + add + s.substr(i));
+    }
+  texts.push_back("{" + std::string(70, '[') + std::string(70, ']') + "}");
+  texts.push_back("{\"/d\":" + std::string(70, '[') + std::string(70, ']') + "}");
+  int decided = 0;
+  for (const std::string& text : texts) {
+    std::vector<internal::FolderConfName> names;
+    if (!internal::ViewFolderConf(text.data(), text.size(), names)) continue;
+    ++decided;
+    Json::Value parsed;
+    ASSERT_TRUE(internal::JsonFromString(parsed, text)) << text;
+    ASSERT_TRUE(parsed.isObject()) << text;
+    std::vector<std::string> viewed;
+    for (const auto& name : names) viewed.emplace_back(name.data, name.size);
+    EXPECT_EQ(viewed, parsed.getMemberNames()) << text;
+  }
+  EXPECT_GT(decided, 200);
+  // The forms the library itself writes are always decided.
+  for (const std::string& text : {seeds[0], seeds[1], seeds[4], std::string("{}")}) {
+    std::vector<internal::FolderConfName> names;
+    EXPECT_TRUE(internal::ViewFolderConf(text.data(), text.size(), names)) << text;
+  }
+}
+
+// Guards that a query answered through the fast reader gives the answer, the log lines,
+// the error code and the platform calls of one answered through the full load: each
+// folder.conf is asked once as written and once with its names escaped ("\/"), which
+// the fast reader leaves to the load.
+TEST_F(QueriesTest, FastReaderMatchesTheFullLoad) {
+  AddShare("video");
+  AddShare("photo");
+  std::mt19937 rng(3);
+  const char* const shares[] = {"video", "photo", "gone"};
+  std::vector<Json::Value> confs;
+  for (int n : {0, 1, 5, 40}) {
+    Json::Value conf(Json::objectValue);
+    for (int i = 0; i < n; ++i) {
+      const std::string path = std::string("/") + shares[rng() % 3] + "/d" + std::to_string(rng() % 20);
+      conf[path]["name"] = std::string("n\"\\\x01\xc3\xa9") + std::to_string(i);
+      conf[path]["document"] = rng() % 2 == 0;
+      conf[path]["path"] = path;
+    }
+    if (n == 5) conf[""]["name"] = "no share";
+    if (n == 40) conf["/video"]["x"] = Json::Value(Json::arrayValue);
+    confs.push_back(conf);
+  }
+  const std::vector<std::string> probes{
+      "/video", "/video/d1", "/video/d1/x", "/photo/d10", "/gone/d3/y", "/video/d", "", "/"};
+  auto ask = [&](const std::string& text) {
+    WriteFile(FolderConfPath(), text);
+    std::vector<std::string> seen;
+    for (const std::string& probe : probes) {
+      ErrorHandler::SetError(FILEINDEX_ERR_NONE);
+      logcap::Clear();
+      fake::Get().calls.clear();
+      std::string answers =
+          std::to_string(FILEIDXIsPathIndexed(probe.c_str())) +
+          std::to_string(IndexMgr::IsPathContainIndexed(probe)) +
+          std::to_string(FILEIDXIsFullPathIndexed(Rooted("/volume1" + probe).c_str())) +
+          std::to_string(FILEIDXIsShareIndexed(probe.empty() ? "" : probe.substr(1).c_str()));
+      seen.push_back(answers + " " + std::to_string(ErrorHandler::GetError()));
+      for (const std::string& line : logcap::Texts()) seen.push_back(line);
+      for (const std::string& call : fake::Get().calls) seen.push_back(call);
+    }
+    return seen;
+  };
+  int indexed = 0;
+  for (const Json::Value& conf : confs) {
+    const std::string text = internal::JsonToString(conf);
+    std::string escaped;
+    for (char c : text) escaped += c == '/' ? std::string("\\/") : std::string(1, c);
+    std::vector<internal::FolderConfName> names;
+    ASSERT_TRUE(internal::ViewFolderConf(text.data(), text.size(), names)) << text;
+    ASSERT_TRUE(conf.empty() || !internal::ViewFolderConf(escaped.data(), escaped.size(), names));
+    const std::vector<std::string> fast = ask(text);
+    EXPECT_EQ(fast, ask(escaped)) << text;
+    for (const std::string& line : fast) indexed += line.compare(0, 2, "11") == 0;
+  }
+  EXPECT_GT(indexed, 2);
 }

@@ -101,7 +101,11 @@ TEST(QueueLineViewTest, AgreesWithTheFullParserWhereverItDecides) {
       R"( {"path" : "/v/p", "event" : 256 , "path_old":"/v/q/b", "data":[1,-2,true,null,"s\n\"\u00e9"]} )",
       R"({"event":4294967295,"path":"","path_old":7})",
       R"({"path":"/x","event":1,"data":{"path":"/y"},"path":"/b","event":3})",
-      R"({"event":01,"path":"/a","data":"\ud800"})"};
+      R"({"event":01,"path":"/a","data":"\ud800"})",
+      // The daemon's own compact forms, which the reader takes in fewer steps.
+      R"({"event":256,"path":"/v/p/b","path_old":"/v/q/c"})",
+      R"({"event":4294967296,"path":"/v/p","data":{"inode":12,"size":0,"mtime":-1,"x":[1.5]}})",
+      R"({"event":8,"path":"/v/\u0070","path_old":"/v/q\"","data":null})"};
   Lines lines = seeds;  // plus every one-byte deletion and delimiter insertion
   for (const std::string& s : seeds)
     for (size_t i = 0; i < s.size(); ++i) {

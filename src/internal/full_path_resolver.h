@@ -24,6 +24,11 @@ class FullPathResolver {
   std::unordered_map<std::string, Volume> volumes_;
 };
 
+// A folder's full path found again when none was stored (its share was unknown when the
+// folder was loaded), so that a share that has come back is found; empty, with a log
+// line, when it still is not.
+std::string RetryFullPath(const std::string& path);
+
 }  // namespace internal
 }  // namespace FILEINDEX
 }  // namespace TAVO

@@ -129,10 +129,10 @@ bool JsonFromString(Json::Value& out, const std::string& text) {
   return true;
 }
 
-bool JsonFromFile(Json::Value& out, const std::string& path) {
+bool ReadWholeFile(const std::string& path, std::string& text) {
   int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
   if (fd < 0) return false;
-  std::string text;
+  text.clear();
   char buffer[65536];
   for (;;) {
     ssize_t n = ::read(fd, buffer, sizeof(buffer));
@@ -145,7 +145,12 @@ bool JsonFromFile(Json::Value& out, const std::string& path) {
     text.append(buffer, static_cast<size_t>(n));
   }
   ::close(fd);
-  return JsonFromString(out, text);
+  return true;
+}
+
+bool JsonFromFile(Json::Value& out, const std::string& path) {
+  std::string text;
+  return ReadWholeFile(path, text) && JsonFromString(out, text);
 }
 
 std::string JsonToString(const Json::Value& value) {

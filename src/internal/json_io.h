@@ -16,6 +16,8 @@ namespace internal {
 bool JsonFromString(Json::Value& out, const std::string& text);
 // Parses a whole file; false when unreadable or not valid JSON.
 bool JsonFromFile(Json::Value& out, const std::string& path);
+// The whole file as it is, for readers that parse it themselves; false when unreadable.
+bool ReadWholeFile(const std::string& path, std::string& text);
 // Compact JSON on one line, UTF-8 emitted as is.
 std::string JsonToString(const Json::Value& value);
 // Writes a temporary file beside path, fsyncs it, renames it over path and fsyncs the

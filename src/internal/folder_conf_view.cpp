@@ -1,0 +1,236 @@
+#include "internal/folder_conf_view.h"
+
+#include <cstring>
+
+#ifdef __SSE2__
+#include <emmintrin.h>
+#endif
+
+namespace TAVO {
+namespace FILEINDEX {
+namespace internal {
+
+namespace {
+
+// Well below the JSON library's own nesting limit, which it enforces by throwing.
+const int kMaxDepth = 64;
+// Integers of up to 18 digits fit the JSON library's 64-bit integers; longer ones go
+// through its floating-point conversion, which depends on the stream's locale.
+const size_t kMaxDigits = 18;
+// The JSON library throws on member names of 2^30 bytes and more.
+const size_t kMaxName = size_t(1) << 30;
+
+#define FIDX_HOT inline __attribute__((always_inline))
+
+FIDX_HOT bool IsSpace(char c) { return c == ' ' || c == '\n' || c == '\t' || c == '\r'; }
+FIDX_HOT bool IsDigit(char c) { return c >= '0' && c <= '9'; }
+bool IsHex(char c) { return IsDigit(c) || (c >= 'a' && c <= 'f') || (c >= 'A' && c <= 'F'); }
+
+// Whether a sorts before b in the parsed object's order: bytes compared unsigned, then
+// the shorter first.
+bool Before(const FolderConfName& a, const FolderConfName& b) {
+  const int c = std::memcmp(a.data, b.data, a.size < b.size ? a.size : b.size);
+  return c < 0 || (c == 0 && a.size < b.size);
+}
+
+// Every step takes the position and returns the one after what it read, or null when
+// it gives up.
+class Reader {
+ public:
+  explicit Reader(const char* end) : end_(end) {}
+
+  const char* Root(const char* p, std::vector<FolderConfName>& names) const {
+    p = SkipSpaces(p);
+    if (!At(p, '{')) return nullptr;
+    p = SkipSpaces(p + 1);
+    if (At(p, '}')) return p + 1;
+    for (;;) {
+      if (!At(p, '"')) return nullptr;
+      const char* begin = p + 1;
+      bool escaped;
+      p = String(p, escaped);
+      // An escaped name would have to be decoded to be compared.
+      if (p == nullptr || escaped) return nullptr;
+      const FolderConfName name{begin, static_cast<size_t>(p - 1 - begin)};
+      if (name.size >= kMaxName || (!names.empty() && !Before(names.back(), name))) return nullptr;
+      names.push_back(name);
+      p = SkipSpaces(p);
+      if (!At(p, ':')) return nullptr;
+      p = Value(SkipSpaces(p + 1), 1);
+      if (p == nullptr) return nullptr;
+      p = SkipSpaces(p);
+      if (At(p, ',')) {
+        p = SkipSpaces(p + 1);
+        continue;
+      }
+      return At(p, '}') ? p + 1 : nullptr;
+    }
+  }
+
+  FIDX_HOT const char* SkipSpaces(const char* p) const {
+    while (p < end_ && IsSpace(*p)) ++p;
+    return p;
+  }
+
+ private:
+  FIDX_HOT bool At(const char* p, char c) const { return p < end_ && *p == c; }
+
+  // The first quote, backslash or control character in [p, end_), or end_.
+  FIDX_HOT const char* FindStringStop(const char* p) const {
+#ifdef __SSE2__
+    const __m128i quote = _mm_set1_epi8('"');
+    const __m128i backslash = _mm_set1_epi8('\\');
+    const __m128i control = _mm_set1_epi8(0x1F);
+    while (end_ - p >= 16) {
+      const __m128i bytes = _mm_loadu_si128(reinterpret_cast<const __m128i*>(p));
+      const __m128i stops =
+          _mm_or_si128(_mm_or_si128(_mm_cmpeq_epi8(bytes, quote), _mm_cmpeq_epi8(bytes, backslash)),
+                       _mm_cmpeq_epi8(_mm_max_epu8(bytes, control), control));
+      const unsigned mask = static_cast<unsigned>(_mm_movemask_epi8(stops));
+      if (mask != 0) return p + __builtin_ctz(mask);
+      p += 16;
+    }
+#endif
+    while (p < end_ && *p != '"' && *p != '\\' && static_cast<unsigned char>(*p) >= 0x20) ++p;
+    return p;
+  }
+
+  // n hex digits at p.
+  const char* Hex(const char* p, int n) const {
+    if (end_ - p < n) return nullptr;
+    for (int i = 0; i < n; ++i)
+      if (!IsHex(p[i])) return nullptr;
+    return p + n;
+  }
+
+  // At a backslash: one escape the JSON library decodes. A high surrogate must be
+  // followed by a second \u escape, whatever its value.
+  const char* Escape(const char* p) const {
+    ++p;
+    if (p == end_) return nullptr;
+    switch (*p) {
+      case '"':
+      case '\\':
+      case '/':
+      case 'b':
+      case 'f':
+      case 'n':
+      case 'r':
+      case 't':
+        return p + 1;
+      case 'u': {
+        const char* digits = p + 1;
+        p = Hex(digits, 4);
+        if (p == nullptr) return nullptr;
+        const bool high = (digits[0] == 'd' || digits[0] == 'D') &&
+                          (digits[1] == '8' || digits[1] == '9' || digits[1] == 'a' || digits[1] == 'A' ||
+                           digits[1] == 'b' || digits[1] == 'B');
+        if (!high) return p;
+        if (!At(p, '\\') || !At(p + 1, 'u')) return nullptr;
+        return Hex(p + 2, 4);
+      }
+      default:
+        return nullptr;
+    }
+  }
+
+  // At the opening quote; escaped tells whether the text holds escapes.
+  FIDX_HOT const char* String(const char* p, bool& escaped) const {
+    ++p;
+    escaped = false;
+    for (;;) {
+      p = FindStringStop(p);
+      if (p == end_) return nullptr;
+      if (*p == '"') return p + 1;
+      if (*p != '\\') return nullptr;  // a raw control character
+      escaped = true;
+      p = Escape(p);
+      if (p == nullptr) return nullptr;
+    }
+  }
+
+  // A plain integer: no leading zero, at most kMaxDigits digits, no fraction or exponent.
+  const char* Number(const char* p) const {
+    if (*p == '-') ++p;
+    const char* digits = p;
+    while (p < end_ && IsDigit(*p)) ++p;
+    const size_t n = static_cast<size_t>(p - digits);
+    if (n == 0 || n > kMaxDigits || (n > 1 && *digits == '0')) return nullptr;
+    if (p < end_ && (*p == '.' || *p == 'e' || *p == 'E')) return nullptr;
+    return p;
+  }
+
+  const char* Literal(const char* p, const char* word, size_t size) const {
+    if (static_cast<size_t>(end_ - p) < size || std::memcmp(p, word, size) != 0) return nullptr;
+    return p + size;
+  }
+
+  const char* Value(const char* p, int depth) const {
+    if (p == end_) return nullptr;
+    bool escaped;
+    switch (*p) {
+      case '"':
+        return String(p, escaped);
+      case '{':
+        return Container(p, depth, '}', true);
+      case '[':
+        return Container(p, depth, ']', false);
+      case 't':
+        return Literal(p, "true", 4);
+      case 'f':
+        return Literal(p, "false", 5);
+      case 'n':
+        return Literal(p, "null", 4);
+      default:
+        return Number(p);
+    }
+  }
+
+  const char* Container(const char* p, int depth, char close, bool object) const {
+    if (depth >= kMaxDepth) return nullptr;
+    p = SkipSpaces(p + 1);
+    if (At(p, close)) return p + 1;
+    for (;;) {
+      if (object) {
+        bool escaped;
+        if (!At(p, '"')) return nullptr;
+        p = String(p, escaped);
+        if (p == nullptr) return nullptr;
+        p = SkipSpaces(p);
+        if (!At(p, ':')) return nullptr;
+        p = SkipSpaces(p + 1);
+      }
+      p = Value(p, depth + 1);
+      if (p == nullptr) return nullptr;
+      p = SkipSpaces(p);
+      if (At(p, ',')) {
+        p = SkipSpaces(p + 1);
+        continue;
+      }
+      return At(p, close) ? p + 1 : nullptr;
+    }
+  }
+
+  const char* const end_;
+};
+
+#undef FIDX_HOT
+
+}  // namespace
+
+bool ViewFolderConf(const char* data, size_t size, std::vector<FolderConfName>& names) {
+  names.clear();
+  const Reader reader(data + size);
+  const char* p = reader.Root(data, names);
+  // Only blanks may follow the object (a NUL byte, which the JSON library takes for the
+  // end of the text, is left to it).
+  if (p == nullptr || reader.SkipSpaces(p) != data + size) {
+    names.clear();
+    return false;
+  }
+  return true;
+}
+
+}  // namespace internal
+}  // namespace FILEINDEX
+}  // namespace TAVO
