@@ -124,7 +124,9 @@ void PrintTable() {
 
 std::string g_workspace;
 bool g_mounted = false;
-bool g_keep = false;  // leave the workspace for a look at the daemons' logs
+bool g_keep = false;
+// The workspace's path again, for the signal handler, which may not touch std::string.
+char g_workspacePath[256];  // leave the workspace for a look at the daemons' logs
 volatile sig_atomic_t g_daemonPids[2] = {0, 0};
 
 bool IsOurDaemon(pid_t pid) {
@@ -162,6 +164,7 @@ void StopDaemons() {
 void RemoveWorkspace() {
   if (g_workspace.empty()) return;
   StopDaemons();
+  g_workspacePath[0] = '\0';
   if (g_keep) {
     std::printf("workspace kept: %s%s\n", g_workspace.c_str(), g_mounted ? " (umount it when done)" : "");
     g_workspace.clear();
@@ -179,12 +182,25 @@ void RemoveWorkspace() {
 }
 
 void OnSignal(int signal) {
-  // Only the daemons are stopped here (kill is async-signal-safe); the exit handler
-  // removes the workspace.
+  // Only async-signal-safe calls: the daemons are killed, and the workspace unmounted or
+  // removed by rm in a child process.
   for (auto& slot : g_daemonPids) {
     if (slot > 0) ::kill(static_cast<pid_t>(slot), SIGKILL);
   }
-  std::_Exit(128 + signal);
+  if (g_workspacePath[0] != '\0') {
+    if (g_mounted) {
+      ::umount2(g_workspacePath, MNT_DETACH);
+      ::rmdir(g_workspacePath);
+    } else {
+      pid_t pid = ::fork();
+      if (pid == 0) {
+        ::execl("/bin/rm", "rm", "-rf", g_workspacePath, static_cast<char*>(nullptr));
+        ::_exit(127);
+      }
+      if (pid > 0) ::waitpid(pid, nullptr, 0);
+    }
+  }
+  ::_exit(128 + signal);
 }
 
 bool MakeWorkspace() {
@@ -991,6 +1007,7 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "cannot make a workspace: %s\n", std::strerror(errno));
     return 1;
   }
+  std::snprintf(g_workspacePath, sizeof(g_workspacePath), "%s", g_workspace.c_str());
   std::atexit(RemoveWorkspace);
   struct sigaction action {};
   action.sa_handler = OnSignal;
