@@ -278,26 +278,24 @@ void IndexingService::HandleCommand(const Json::Value& command) {
     ReloadConfig();
   } else if (type == "pause" || type == "resume") {
     ReloadPause();  // status.conf, already saved by the sender, is the authority
-  } else if (type == "delete_share_worker") {
+  } else if (type == "delete_share_worker" || type == "revive_share_worker") {
     if (share.empty()) {
       Log(LOG_ERR, "command %s without a share name dropped", type.c_str());
       return;
     }
-    Log(LOG_INFO, "share %s: worker stopped", share.c_str());
-    m_stoppedByCommand.insert(share);
+    bool stop = type == "delete_share_worker";
+    Log(LOG_INFO, "share %s: worker %s", share.c_str(), stop ? "stopped" : "revived");
     auto it = m_shares.find(share);
-    if (it != m_shares.end()) {
-      it->second.stop = Stop::kByCommand;
-      it->second.indexer.reset();
-    }
-  } else if (type == "revive_share_worker") {
-    if (share.empty()) {
-      Log(LOG_ERR, "command %s without a share name dropped", type.c_str());
+    if (stop) {
+      m_stoppedByCommand.insert(share);
+      if (it != m_shares.end()) {
+        it->second.stop = Stop::kByCommand;
+        it->second.indexer.reset();  // its index is closed cleanly until it is revived
+      }
       return;
     }
-    Log(LOG_INFO, "share %s: worker revived", share.c_str());
+    // Revival also ends a stop for lack of space: the space is checked again first.
     m_stoppedByCommand.erase(share);
-    auto it = m_shares.find(share);
     if (it != m_shares.end()) {
       it->second.stop = Stop::kNone;
       it->second.nextSpaceCheck = Clock::time_point();
