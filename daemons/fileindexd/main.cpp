@@ -25,8 +25,9 @@ namespace {
 
 const char kSocketPath[] = "/var/run/fileindexd.sock";
 const char kInstanceLock[] = "/var/run/fileindexd.pid";
-// Long enough to get work done, short enough that commands and signals wait little.
-const std::chrono::milliseconds kSliceBudget(50);
+// Long enough that a crawl's commits (each writes out the name index's pending terms) stay
+// few, short enough that commands and signals wait little.
+const std::chrono::milliseconds kSliceBudget(200);
 
 void Usage(FILE* out) {
   std::fprintf(out,

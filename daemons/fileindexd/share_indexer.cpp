@@ -180,7 +180,7 @@ bool ShareIndexer::RunTask(const Task& task) {
       m_pendingPaths.erase(task.path);
       return ReconcilePath(task.path);
     case TaskType::kTree:
-      return ReconcileDirectory(task.path);
+      return ReconcileDirectory(task);
     case TaskType::kFolderCrawled:
       return FolderCrawled(task.path);
     case TaskType::kFolderGone:
@@ -223,10 +223,11 @@ bool ShareIndexer::ReconcilePath(const std::string& path) {
 
 // Makes the index's entries of one directory match the directory, and queues its
 // subdirectories to be crawled next.
-bool ShareIndexer::ReconcileDirectory(const std::string& dir) {
+bool ShareIndexer::ReconcileDirectory(const Task& task) {
+  const std::string& dir = task.path;
   const std::string full = FullPath(dir);
-  std::string folder;
-  if (!GoverningFolder(full, folder) || IsExcluded(folder, dir)) {
+  std::string folder = task.folder;
+  if (!task.checked && (!GoverningFolder(full, folder) || IsExcluded(folder, dir))) {
     // Nothing here is indexed any more, except folders configured below it.
     if (!dir.empty() && !m_store->Remove(DirName(dir), BaseName(dir))) return false;
     if (!m_store->RemoveBelow(dir)) return false;
@@ -242,16 +243,16 @@ bool ShareIndexer::ReconcileDirectory(const std::string& dir) {
   for (Entry& entry : indexedChildren) indexed.emplace(entry.name, std::move(entry));
 
   int fd = ::open(full.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-  DIR* stream = fd >= 0 ? ::fdopendir(fd) : nullptr;
-  if (stream == nullptr) {
+  std::unique_ptr<DIR, int (*)(DIR*)> stream(fd >= 0 ? ::fdopendir(fd) : nullptr, ::closedir);
+  if (!stream) {
     int reason = errno;
     if (fd >= 0) ::close(fd);
     if (reason != ENOENT && reason != ENOTDIR && reason != ELOOP)
       Log(LOG_WARNING, "cannot read %s: %s", full.c_str(), std::strerror(reason));
     return ReconcilePath(dir);  // gone or replaced: its entry and everything below go
   }
-  std::vector<std::string> subdirectories;
-  while (struct dirent* item = ::readdir(stream)) {
+  std::vector<Task> subdirectories;
+  while (struct dirent* item = ::readdir(stream.get())) {
     const std::string name = item->d_name;
     if (name == "." || name == "..") continue;
     struct stat st;
@@ -263,8 +264,10 @@ bool ShareIndexer::ReconcileDirectory(const std::string& dir) {
     bool excluded = (isDir || dir.empty()) ? TAVO::FILEINDEX::IsSkipIndex(full + "/" + name)
                                            : TAVO::FILEINDEX::IsSystemPreservedFileName(name);
     if (excluded) continue;
+    // A directory governs itself only when it is a configured folder, and even then the
+    // library's order of folders decides.
     std::string entryFolder = folder;
-    if (isDir && m_config.flags.count(path)) entryFolder = path;
+    if (isDir && m_config.flags.count(path) && !GoverningFolder(full + "/" + name, entryFolder)) continue;
     Entry entry = EntryFor(dir, name, st, entryFolder);
     if (!entry.isDir && !KindAllowed(folder, entry.kind)) continue;
     auto it = indexed.find(name);
@@ -274,23 +277,20 @@ bool ShareIndexer::ReconcileDirectory(const std::string& dir) {
       indexed.erase(it);
       if (wasDir && !entry.isDir && !m_store->RemoveBelow(path)) return false;
       if (same) {
-        if (isDir) subdirectories.push_back(path);
+        if (isDir) subdirectories.push_back({TaskType::kTree, path, entryFolder, true});
         continue;
       }
     }
-    if (!m_store->Put(entry)) {
-      ::closedir(stream);
-      return false;
-    }
+    if (!m_store->Put(entry)) return false;
     ++m_entriesWritten;
-    if (isDir) subdirectories.push_back(path);
+    if (isDir) subdirectories.push_back({TaskType::kTree, path, entryFolder, true});
   }
-  ::closedir(stream);
+  stream.reset();
   for (const auto& gone : indexed) {
     if (!m_store->Remove(dir, gone.first)) return false;
   }
   for (auto it = subdirectories.rbegin(); it != subdirectories.rend(); ++it)
-    m_tasks.push_front({TaskType::kTree, *it});
+    m_tasks.push_front(std::move(*it));
   return true;
 }
 

@@ -55,15 +55,21 @@ class ShareIndexer {
  private:
   enum class TaskType { kPath, kTree, kFolderCrawled, kFolderGone };
   struct Task {
+    Task(TaskType type, std::string path, std::string folder = "", bool checked = false)
+        : type(type), path(std::move(path)), folder(std::move(folder)), checked(checked) {}
     TaskType type;
     std::string path;  // relative to the share directory
+    // For a directory reached by a crawl from its parent: the folder governing it, its
+    // place already checked against the rules on the way down.
+    std::string folder;
+    bool checked = false;
   };
 
   ShareIndexer(const ShareConfig& config, std::unique_ptr<fileindex_store::IndexWriter> store);
 
   bool RunTask(const Task& task);
   bool ReconcilePath(const std::string& path);
-  bool ReconcileDirectory(const std::string& dir);
+  bool ReconcileDirectory(const Task& task);
   bool FolderCrawled(const std::string& folder);
   bool FolderGone(const std::string& folder);
   // Crawls a folder with its current flags, unless such a crawl is already queued and
