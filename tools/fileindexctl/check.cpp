@@ -10,12 +10,14 @@
 #include <cstring>
 #include <ctime>
 #include <fstream>
+#include <functional>
 #include <map>
 #include <set>
 #include <sstream>
 
 #include "commands.h"
 #include "diagnose.h"
+#include "index_view.h"
 #include "input.h"
 #include "output.h"
 
@@ -63,8 +65,11 @@ bool IsTemporaryOf(const std::string& name, const std::string& base) {
   return true;
 }
 
-// Files in dir (recursively when asked) that are left-over temporary files.
-void FindStrays(const std::string& dir, bool recursive, std::vector<std::string>& out) {
+// Calls visit(path, name, st) for every entry but a directory in dir, and in the
+// directories below it when recursive.
+void ForEachFile(
+    const std::string& dir, bool recursive,
+    const std::function<void(const std::string&, const std::string&, const struct stat&)>& visit) {
   DIR* d = ::opendir(dir.c_str());
   if (d == nullptr) return;
   std::vector<std::string> names;
@@ -75,40 +80,28 @@ void FindStrays(const std::string& dir, bool recursive, std::vector<std::string>
     const std::string path = dir + "/" + name;
     struct stat st;
     if (::lstat(path.c_str(), &st) != 0) continue;
-    if (S_ISDIR(st.st_mode)) {
-      if (recursive) FindStrays(path, true, out);
-      continue;
+    if (!S_ISDIR(st.st_mode)) {
+      visit(path, name, st);
+    } else if (recursive) {
+      ForEachFile(path, true, visit);
     }
-    std::string::size_type dot = name.rfind('.');
-    if (!S_ISREG(st.st_mode) || dot == std::string::npos || !IsTemporaryOf(name, name.substr(0, dot)))
-      continue;
-    if (std::time(nullptr) - st.st_mtime < kStrayAge) continue;
-    out.push_back(path);
   }
+}
+
+// Files in dir (recursively when asked) that are left-over temporary files.
+void FindStrays(const std::string& dir, bool recursive, std::vector<std::string>& out) {
+  ForEachFile(dir, recursive, [&](const std::string& path, const std::string& name, const struct stat& st) {
+    std::string::size_type dot = name.rfind('.');
+    if (!S_ISREG(st.st_mode) || dot == std::string::npos || !IsTemporaryOf(name, name.substr(0, dot))) return;
+    if (std::time(nullptr) - st.st_mtime < kStrayAge) return;
+    out.push_back(path);
+  });
 }
 
 void FindWatchLists(const std::string& dir, std::vector<std::string>& out) {
-  DIR* d = ::opendir(dir.c_str());
-  if (d == nullptr) return;
-  std::vector<std::string> names;
-  while (dirent* entry = ::readdir(d)) names.push_back(entry->d_name);
-  ::closedir(d);
-  for (const std::string& name : names) {
-    if (name == "." || name == "..") continue;
-    const std::string path = dir + "/" + name;
-    struct stat st;
-    if (::lstat(path.c_str(), &st) != 0) continue;
-    if (S_ISDIR(st.st_mode)) {
-      FindWatchLists(path, out);
-    } else if (name.size() > 5 && name.compare(name.size() - 5, 5, ".json") == 0) {
-      out.push_back(path);
-    }
-  }
-}
-
-std::string QueuePath(const std::string& share) {
-  char buffer[4096] = {0};
-  return FILEIDXQueuePathGet(share.c_str(), buffer, sizeof(buffer)) >= 0 ? buffer : "";
+  ForEachFile(dir, true, [&](const std::string& path, const std::string& name, const struct stat&) {
+    if (name.size() > 5 && name.compare(name.size() - 5, 5, ".json") == 0) out.push_back(path);
+  });
 }
 
 const std::string kWatchRoot = "/run/tavotifyd/fileindex";
@@ -147,7 +140,7 @@ int Check(Session& s, bool repair) {
   std::set<std::string> expectedFiles;
   std::set<std::string> staleShares;
   for (const auto& entry : byShare) {
-    const std::string queue = QueuePath(entry.first);
+    const std::string queue = QueuePathOf(entry.first);
     if (queue.empty()) continue;
     const std::string file = Rooted(kWatchRoot) + Unrooted(queue) + ".json";
     expectedFiles.insert(file);
@@ -176,7 +169,7 @@ int Check(Session& s, bool repair) {
 
   // 4. Queue files hold only whole lines (a torn last line is what a crash mid-append leaves).
   for (const auto& entry : byShare) {
-    const std::string queue = QueuePath(entry.first);
+    const std::string queue = QueuePathOf(entry.first);
     for (const std::string& file : {queue, queue + ".tmp"}) {
       std::string text;
       if (queue.empty() || !ReadText(file, text) || text.empty()) continue;

@@ -14,22 +14,22 @@ namespace FI = TAVO::FILEINDEX;
 
 namespace {
 
-std::string DatabaseDirectory(const std::string& share) {
-  char buffer[4096] = {0};
-  return FILEIDXDBPathGet(share.c_str(), buffer, sizeof(buffer)) < 0 ? "" : buffer;
-}
-
-std::string QueuePath(const std::string& share) {
-  char buffer[4096] = {0};
-  return FILEIDXQueuePathGet(share.c_str(), buffer, sizeof(buffer)) < 0 ? "" : buffer;
-}
-
 bool IsInside(const std::string& path, const std::string& dir) {
   return path == dir ||
          (path.size() > dir.size() && path.compare(0, dir.size(), dir) == 0 && path[dir.size()] == '/');
 }
 
 }  // namespace
+
+std::string QueuePathOf(const std::string& share) {
+  char buffer[4096] = {0};
+  return FILEIDXQueuePathGet(share.c_str(), buffer, sizeof(buffer)) < 0 ? "" : buffer;
+}
+
+std::string DatabaseDirectoryOf(const std::string& share) {
+  char buffer[4096] = {0};
+  return FILEIDXDBPathGet(share.c_str(), buffer, sizeof(buffer)) < 0 ? "" : buffer;
+}
 
 std::map<std::string, IndexedShare> IndexedShares(const std::vector<FI::Folder>& folders) {
   std::map<std::string, IndexedShare> shares;
@@ -56,7 +56,7 @@ void SearchShares(const std::map<std::string, IndexedShare>& shares, const filei
   for (const auto& entry : shares) {
     const IndexedShare& share = entry.second;
     std::string error;
-    auto reader = fileindex_store::IndexReader::Open(DatabaseDirectory(share.name), error);
+    auto reader = fileindex_store::IndexReader::Open(DatabaseDirectoryOf(share.name), error);
     std::vector<fileindex_store::Hit> found;
     if (!reader || !reader->Search(query, found)) {
       unavailable[share.name] = reader ? reader->LastError() : error;
@@ -82,7 +82,7 @@ void SearchShares(const std::map<std::string, IndexedShare>& shares, const filei
 ShareFigures FiguresOf(const IndexedShare& share) {
   ShareFigures figures;
   std::string error;
-  auto reader = fileindex_store::IndexReader::Open(DatabaseDirectory(share.name), error);
+  auto reader = fileindex_store::IndexReader::Open(DatabaseDirectoryOf(share.name), error);
   std::map<std::string, std::uint64_t> byFolder;
   if (reader && reader->CountByFolder(byFolder)) {
     figures.indexAvailable = true;
@@ -93,7 +93,7 @@ ShareFigures FiguresOf(const IndexedShare& share) {
       figures.indexed += count;
     }
   }
-  const std::string queue = QueuePath(share.name);
+  const std::string queue = QueuePathOf(share.name);
   for (const std::string& file : {queue, fileindex_queue::TmpCompanion(queue)}) {
     std::ifstream in(file);
     for (std::string line; std::getline(in, line);) {

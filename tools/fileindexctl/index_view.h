@@ -20,6 +20,10 @@ struct IndexedShare {
   std::map<std::string, std::string> folderByPath;  // folder share path -> path relative to the share
 };
 
+// A share's queue file and index directory (empty when the share is unknown).
+std::string QueuePathOf(const std::string& share);
+std::string DatabaseDirectoryOf(const std::string& share);
+
 // The shares holding configured folders, by name.
 std::map<std::string, IndexedShare> IndexedShares(const std::vector<TAVO::FILEINDEX::Folder>& folders);
 
