@@ -19,63 +19,16 @@
 #include <string>
 #include <thread>
 #include <vector>
+
+#include "host_support.h"
 namespace fs = std::filesystem;
 
 namespace {
-const std::string kCtl = FILEINDEX_BINARY_DIR "/tools/fileindexctl/fileindexctl";
+using namespace host_test;
 
-struct Result {
-  int status;
-  std::string out, err;
-};
-std::string ReadFile(const std::string& path) {
-  std::stringstream text;
-  text << std::ifstream(path).rdbuf();
-  return text.str();
-}
-bool ParseJson(const std::string& text, Json::Value& out) {
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  std::istringstream in(text);
-  return Json::parseFromStream(builder, in, &out, nullptr);
-}
-class CliTest : public ::testing::Test {
+class CliTest : public SandboxTest {
  protected:
-  static void SetUpTestSuite() {
-    // The probe outlives the hook that starts it; as a subreaper this process collects it.
-    ::prctl(PR_SET_CHILD_SUBREAPER, 1);
-    ::unsetenv("FILEINDEX_SYSROOT");
-  }
-  void SetUp() override {
-    char pattern[] = "/tmp/host_cli.XXXXXX";
-    ASSERT_NE(::mkdtemp(pattern), nullptr);
-    work_ = pattern;
-    root_ = work_ + "/root";
-    ASSERT_EQ(Run({"sandbox", "init", root_, "--probe"}, false).status, 0);
-    root_ = fs::canonical(root_).string();
-  }
-  void TearDown() override {
-    std::string pid = ReadFile(root_ + "/var/run/fileindexd.pid");
-    Run({"sandbox", "stop"});
-    if (!pid.empty() && std::stoi(pid) > 0) ::kill(std::stoi(pid), SIGKILL);  // in case stop failed
-    while (::waitpid(-1, nullptr, WNOHANG) > 0) continue;
-    fs::remove_all(work_);
-  }
-  Result Run(const std::vector<std::string>& args, bool sysroot = true) {
-    std::string command = kCtl + (sysroot ? " --sysroot '" + root_ + "'" : "");
-    for (const std::string& arg : args) command += " '" + arg + "'";
-    int status = std::system((command + " >" + work_ + "/stdout 2>" + work_ + "/stderr").c_str());
-    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, ReadFile(work_ + "/stdout"),
-            ReadFile(work_ + "/stderr")};
-  }
-  Json::Value RunJson(std::vector<std::string> args) {
-    args.insert(args.begin(), "--json");
-    Result result = Run(args);
-    Json::Value value;
-    EXPECT_EQ(result.status, 0) << result.out << result.err;
-    EXPECT_TRUE(ParseJson(result.out, value)) << "not JSON: " << result.out;
-    return value;
-  }
+  void SetUp() override { InitSandbox("host_cli", {"--probe"}); }
   // The commands the daemon probe logged, waiting briefly for the count expected.
   std::vector<Json::Value> DaemonCommands(size_t expected) {
     std::vector<Json::Value> commands;
@@ -87,7 +40,6 @@ class CliTest : public ::testing::Test {
     }
     return commands;
   }
-  std::string work_, root_;
 };
 
 // Add/list/remove drive the daemon, watch lists and Spotlight; the last folder tears them down.

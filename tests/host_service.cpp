@@ -32,58 +32,27 @@
 #include <thread>
 #include <vector>
 
+#include "host_support.h"
+
 namespace fs = std::filesystem;
 using namespace std::chrono_literals;
 using Clock = std::chrono::steady_clock;
 
 namespace {
 
-const std::string kCtl = FILEINDEX_BINARY_DIR "/tools/fileindexctl/fileindexctl";
+using namespace host_test;
+
 // Generous, for the sanitizer build; a healthy daemon answers in a fraction of it.
-constexpr auto kDeadline = 20s;
+constexpr std::chrono::milliseconds kDeadline = 20s;
 
-struct Result {
-  int status;
-  std::string out, err;
-};
-
-std::string ReadFile(const std::string& path) {
-  std::stringstream text;
-  text << std::ifstream(path).rdbuf();
-  return text.str();
-}
-
-void WriteFile(const std::string& path, const std::string& text) {
-  fs::create_directories(fs::path(path).parent_path());
-  std::ofstream(path, std::ios::trunc) << text;
-}
-
-Json::Value ParseJson(const std::string& text) {
-  Json::CharReaderBuilder builder;
-  std::istringstream in(text);
-  Json::Value value;
-  return Json::parseFromStream(builder, in, &value, nullptr) ? value : Json::Value();
-}
-
-// Polls every 20 ms until ready() holds or the time is up.
-template <class Ready>
-bool WaitUntil(Ready ready, Clock::duration limit = kDeadline) {
-  for (auto end = Clock::now() + limit;; std::this_thread::sleep_for(20ms)) {
-    if (ready()) return true;
-    if (Clock::now() >= end) return false;
-  }
+bool WaitUntil(const std::function<bool()>& ready, std::chrono::milliseconds limit = kDeadline) {
+  return host_test::WaitUntil(ready, limit);
 }
 
 std::size_t Count(const std::string& text, const std::string& what) {
   std::size_t count = 0;
   for (std::size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++count;
   return count;
-}
-
-std::string Quote(const std::string& text) {
-  std::string quoted = "'";
-  for (char c : text) quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
-  return quoted + "'";
 }
 
 int Connect(const std::string& path) {
@@ -102,53 +71,19 @@ void Send(int fd, const std::string& bytes) { ::send(fd, bytes.data(), bytes.siz
 
 std::string LengthField(std::uint32_t length) { return std::string(reinterpret_cast<char*>(&length), 4); }
 
-class ServiceTest : public ::testing::Test {
+class ServiceTest : public SandboxTest {
  protected:
-  static void SetUpTestSuite() {
-    // The daemons outlive the hooks that start them; as a subreaper this process reaps them.
-    ::prctl(PR_SET_CHILD_SUBREAPER, 1);
-    ::unsetenv("FILEINDEX_SYSROOT");
-  }
   void SetUp() override {
-    char pattern[] = "/tmp/host_service.XXXXXX";
-    ASSERT_NE(::mkdtemp(pattern), nullptr);
-    work_ = pattern;
+    InitSandbox("host_service", {});
     ::chmod(work_.c_str(), 0755);  // other users reach the socket and the index, as on a host
-    root_ = work_ + "/root";
-    ASSERT_EQ(Run({"sandbox", "init", root_}, false).status, 0);
-    root_ = fs::canonical(root_).string();
   }
-  void TearDown() override {
-    if (root_.empty() || work_.empty()) return;
-    std::vector<pid_t> pids{Pid("fileindexd"), Pid("tavotifyd")};
-    Run({"sandbox", "stop"});
-    for (pid_t pid : pids) {
-      // Only a daemon of this sandbox, in case the stop failed.
-      if (pid > 0 && ReadFile("/proc/" + std::to_string(pid) + "/cmdline").find(root_) != std::string::npos)
-        ::kill(pid, SIGKILL);
-      if (pid > 0) ::waitpid(pid, nullptr, 0);
-    }
-    while (::waitpid(-1, nullptr, WNOHANG) > 0) continue;
-    // Sanitizer builds report into the daemons' logs, some of it only at exit.
+  // Sanitizer builds report into the daemons' logs, some of it only at exit.
+  void CheckLogs() override {
     for (const char* log : {"fileindexd.log", "tavotifyd.log"}) {
       std::string text = ReadFile(root_ + "/var/log/" + log);
       EXPECT_EQ(text.find("Sanitizer"), std::string::npos) << log << ":\n" << text;
       EXPECT_EQ(text.find("runtime error"), std::string::npos) << log << ":\n" << text;
     }
-    fs::remove_all(work_);
-  }
-  Result Run(const std::vector<std::string>& args, bool sysroot = true, const std::string& prefix = "") {
-    std::string command = prefix + kCtl + (sysroot ? " --sysroot " + Quote(root_) : "");
-    for (const std::string& arg : args) command += " " + Quote(arg);
-    int status = std::system((command + " >" + work_ + "/stdout 2>" + work_ + "/stderr").c_str());
-    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, ReadFile(work_ + "/stdout"),
-            ReadFile(work_ + "/stderr")};
-  }
-  Json::Value RunJson(std::vector<std::string> args) {
-    args.insert(args.begin(), "--json");
-    Result result = Run(args);
-    EXPECT_EQ(result.status, 0) << result.out << result.err;
-    return ParseJson(result.out);
   }
   std::string Status() { return RunJson({"status"})["status"].asString(); }
   // The share paths that a search for words finds.
@@ -185,10 +120,6 @@ class ServiceTest : public ::testing::Test {
     });
   }
 
-  pid_t Pid(const std::string& daemon) {
-    std::string text = ReadFile(root_ + "/var/run/" + daemon + ".pid");
-    return text.empty() ? 0 : static_cast<pid_t>(std::atoi(text.c_str()));
-  }
   std::string Share(const std::string& name) { return root_ + "/volume1/" + name; }
   std::string Queue(const std::string& share) { return Share(share) + "/@eaDir/TAVO@file_index_queue"; }
   std::string Database(const std::string& share) {
@@ -246,7 +177,6 @@ class ServiceTest : public ::testing::Test {
     return paths;
   }
 
-  std::string work_, root_;
   Json::Value lastSearch_;
 };
 
@@ -391,7 +321,7 @@ TEST_F(ServiceTest, IndexEqualsDiskAfterRepeatedKillsUnderChanges) {
     // Every other kill lands while a queue is being consumed; the others at any moment.
     for (auto end = Clock::now() + 300ms; kill % 2 == 0 && !fs::exists(inProgress) && Clock::now() < end;)
       std::this_thread::sleep_for(1ms);
-    pid_t pid = Pid("fileindexd");
+    pid_t pid = DaemonPid("fileindexd");
     ASSERT_GT(pid, 0);
     ASSERT_EQ(::kill(pid, SIGKILL), 0);
     ASSERT_EQ(::waitpid(pid, nullptr, 0), pid);
@@ -443,7 +373,7 @@ TEST_F(ServiceTest, BadQueueLinesAreSkippedAndTheRestApplied) {
   EXPECT_EQ(Count(log, "malformed line skipped"), 4u) << log;
   EXPECT_NE(log.find("line over"), std::string::npos) << log;
   EXPECT_NE(log.find("torn last line skipped"), std::string::npos) << log;
-  EXPECT_EQ(::kill(Pid("fileindexd"), 0), 0);
+  EXPECT_EQ(::kill(DaemonPid("fileindexd"), 0), 0);
 }
 
 // Clients that lie about a frame's length, send garbage or nothing at all neither crash
@@ -451,7 +381,7 @@ TEST_F(ServiceTest, BadQueueLinesAreSkippedAndTheRestApplied) {
 TEST_F(ServiceTest, HostileSocketClientsNeitherCrashNorBlockTheDaemon) {
   ASSERT_TRUE(Add({"/photo/2019"}));
   ASSERT_TRUE(WaitIdle());
-  const pid_t pid = Pid("fileindexd");
+  const pid_t pid = DaemonPid("fileindexd");
   const std::string socket = root_ + "/var/run/fileindexd.sock";
   int hugeLength = Connect(socket);
   ASSERT_GE(hugeLength, 0);
@@ -491,7 +421,7 @@ TEST_F(ServiceTest, HostileSocketClientsNeitherCrashNorBlockTheDaemon) {
     ::close(fd);
   }
   ::close(hugeLength);
-  EXPECT_EQ(Pid("fileindexd"), pid);
+  EXPECT_EQ(DaemonPid("fileindexd"), pid);
   EXPECT_EQ(::kill(pid, 0), 0);
   EXPECT_NE(Log().find("frame length out of range"), std::string::npos) << Log();
 }

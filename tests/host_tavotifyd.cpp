@@ -20,6 +20,7 @@
 #include <thread>
 #include <vector>
 
+#include "host_support.h"
 #include "queue_events.h"
 
 namespace fs = std::filesystem;
@@ -29,18 +30,10 @@ namespace {
 const std::string kDaemon = FILEINDEX_BINARY_DIR "/daemons/tavotifyd/tavotifyd";
 const int kMask = 65486;
 
-std::string ReadFile(const std::string& path) {
-  std::stringstream text;
-  text << std::ifstream(path).rdbuf();
-  return text.str();
-}
-void WriteFile(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+using host_test::ReadFile;
+using host_test::WriteFile;
 bool WaitUntil(const std::function<bool()>& done, int millis = 3000) {
-  for (int waited = 0; waited < millis; waited += 10) {
-    if (done()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  return done();
+  return host_test::WaitUntil(done, std::chrono::milliseconds(millis));
 }
 
 class TavotifydTest : public ::testing::Test {
