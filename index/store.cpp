@@ -24,6 +24,8 @@ const char kSchema[] =
     "  is_dir INTEGER NOT NULL, size INTEGER NOT NULL, mtime INTEGER NOT NULL,"
     "  kind INTEGER NOT NULL, folder TEXT NOT NULL);"
     "CREATE UNIQUE INDEX IF NOT EXISTS entries_by_place ON entries(parent, name);"
+    // Searches by content type count and page through one extension's files at a time.
+    "CREATE INDEX IF NOT EXISTS entries_by_type ON entries(ext, is_dir);"
     // Names only; the rows live in entries (an external-content index that the writer
     // keeps in step, statement by statement). Not by triggers: a statement that fires a
     // trigger opens a statement savepoint, and the full-text index writes out its pending
@@ -408,6 +410,14 @@ bool IndexReader::CountByFolder(std::map<std::string, std::uint64_t>& counts) {
   while ((rc = statement->Step()) == SQLITE_ROW)
     counts[statement->Text(0)] = static_cast<std::uint64_t>(statement->Int(1));
   return rc == SQLITE_DONE || Fail("count");
+}
+
+bool IndexReader::AppliedFolders(std::vector<std::string>& out) {
+  Statement* statement = Prepare("SELECT path FROM folders");
+  if (statement == nullptr) return false;
+  int rc;
+  while ((rc = statement->Step()) == SQLITE_ROW) out.push_back(statement->Text(0));
+  return rc == SQLITE_DONE || Fail("folders");
 }
 
 }  // namespace fileindex_store

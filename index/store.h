@@ -15,6 +15,8 @@
 #include <string>
 #include <vector>
 
+#include "search_condition.h"
+
 namespace fileindex_store {
 
 // The kinds of file a folder's four flags switch on and off, and the rest.
@@ -164,8 +166,23 @@ class IndexReader : public Database {
   // Indexed entries per governing folder.
   bool CountByFolder(std::map<std::string, std::uint64_t>& counts);
 
+  struct SelectOptions {
+    std::uint64_t from = 0;  // rows skipped
+    std::size_t size = 50;   // rows returned at most
+    // When set, only entries governed by one of these folders (relative to the share).
+    const std::vector<std::string>* folders = nullptr;
+  };
+  struct Selection {
+    std::uint64_t total = 0;  // every entry meeting the condition
+    std::vector<Hit> hits;    // one page of them, in an order stable between pages
+  };
+  bool Select(const Condition& condition, const SelectOptions& options, Selection& out);
+  // The folders whose entries the index holds, as the indexer last applied them.
+  bool AppliedFolders(std::vector<std::string>& out);
+
  private:
   using Database::Database;
+  bool m_functionsRegistered = false;
 };
 
 // The full-text query for a list of words: each word a quoted prefix phrase, all required.

@@ -116,22 +116,35 @@ TEST_F(HostPlatformTest, MountPointsAreFoundByDeviceAndByMountTable) {
   EXPECT_TRUE(TAVO::FILEINDEX::CanFullPathBeIndexed(photo + "/2019"));
 }
 
-// The Spotlight switch edits [global] only, in place, matching names as Samba does.
+// The Spotlight switch edits [global] only, in place, matching names as Samba does; it
+// brings the Elasticsearch backend along and takes it away again.
 TEST_F(HostPlatformTest, SpotlightEditKeepsEverythingElse) {
+  const std::string backend =
+      "    spotlight backend = elasticsearch\n    elasticsearch:address = 127.0.0.1\n"
+      "    elasticsearch:port = 9200\n"
+      "    elasticsearch:mappings = /usr/share/samba/mdssvc/elasticsearch_mappings.json\n";
   Write("/etc/samba/smb.conf",
         "[global]\n    # spotlight = yes\n    a = b \\\n        c\n\n[photo]\n    spotlight = yes\n");
   EXPECT_EQ(TAVOSMBIsEnableSpotlight(), 0);
   ASSERT_EQ(TAVOSMBSetSpotlight(1), 0);
   EXPECT_EQ(Read("/etc/samba/smb.conf"),
-            "[global]\n    # spotlight = yes\n    a = b \\\n        c\n    spotlight = yes\n\n[photo]\n    "
-            "spotlight = yes\n");
-  Write("/etc/samba/smb.conf", "[Global]\n\tSpot Light=True\n[x]\n");
+            "[global]\n    # spotlight = yes\n    a = b \\\n        c\n    spotlight = yes\n" + backend +
+                "\n[photo]\n    spotlight = yes\n");
   EXPECT_EQ(TAVOSMBIsEnableSpotlight(), 1);
   ASSERT_EQ(TAVOSMBSetSpotlight(0), 0);
-  EXPECT_EQ(Read("/etc/samba/smb.conf"), "[Global]\n\tSpot Light = no\n[x]\n");
-  Write("/etc/samba/smb.conf", "# c\n[x]\n\tpath = /x\n");  // no [global]: added before the first share
+  EXPECT_EQ(Read("/etc/samba/smb.conf"),
+            "[global]\n    # spotlight = yes\n    a = b \\\n        c\n    spotlight = no\n\n[photo]\n    "
+            "spotlight = yes\n");
+  // On without the backend is not on; a cluster's address is kept.
+  Write("/etc/samba/smb.conf", "[Global]\n\tSpot Light=True\n\telasticsearch:address = es1\n[x]\n");
+  EXPECT_EQ(TAVOSMBIsEnableSpotlight(), 0);
   ASSERT_EQ(TAVOSMBSetSpotlight(1), 0);
-  EXPECT_EQ(Read("/etc/samba/smb.conf"), "# c\n[global]\n\tspotlight = yes\n\n[x]\n\tpath = /x\n");
+  EXPECT_NE(Read("/etc/samba/smb.conf")
+                .find("\tSpot Light = yes\n\telasticsearch:address = es1\n\tspotlight backend"),
+            std::string::npos);
+  Write("/etc/samba/smb.conf", "# c\n[x]\n\tpath = /x\n");  // no [global]: added before the first share
+  ASSERT_EQ(TAVOSMBSetSpotlight(0), 0);
+  EXPECT_EQ(Read("/etc/samba/smb.conf"), "# c\n[global]\n\tspotlight = no\n\n[x]\n\tpath = /x\n");
 }
 
 // Case folding with full decomposition: é sorts between e and f, ß equals SS.

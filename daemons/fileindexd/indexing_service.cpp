@@ -164,6 +164,7 @@ void IndexingService::ReloadConfig() {
       Log(LOG_ERR, "share %s: %s", name.c_str(), share.indexer->LastError().c_str());
     }
   }
+  if (m_observer) m_observer(configs);
 }
 
 void IndexingService::OnInotify() {

@@ -6,6 +6,7 @@
 #include <daemon_support.h>
 #include <json/json.h>
 
+#include <functional>
 #include <map>
 #include <memory>
 #include <set>
@@ -17,9 +18,13 @@ namespace fileindexd {
 
 class IndexingService {
  public:
+  using ConfigObserver = std::function<void(const std::map<std::string, ShareConfig>&)>;
+
   explicit IndexingService(fileindex_daemon::EventLoop& loop) : m_loop(loop) {}
   ~IndexingService();
 
+  // Told the shares served each time folder.conf has been read (before Start returns too).
+  void ObserveConfig(ConfigObserver observer) { m_observer = std::move(observer); }
   bool Start(std::string& error);
   void HandleCommand(const Json::Value& command);
 
@@ -60,6 +65,7 @@ class IndexingService {
   std::uint64_t m_reloadTimer = 0;
   std::uint64_t m_pollTimer = 0;
   std::uint64_t m_pauseTimer = 0;
+  ConfigObserver m_observer;
 };
 
 }  // namespace fileindexd

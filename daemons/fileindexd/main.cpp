@@ -2,7 +2,10 @@
 // them into a per-share index, keeps the index current from each share's event queue,
 // and takes the library's commands on its socket.
 //
-//   fileindexd [--sysroot DIR] [--admin-group GROUP] [--log-stderr]
+// It also answers Samba's Spotlight searches (macOS Finder on the shares) over HTTP on the
+// loopback interface.
+//
+//   fileindexd [--sysroot DIR] [--admin-group GROUP] [--spotlight-port PORT] [--log-stderr]
 #include <getopt.h>
 #include <grp.h>
 #include <signal.h>
@@ -20,6 +23,7 @@
 
 #include "command_server.h"
 #include "indexing_service.h"
+#include "spotlight_endpoint.h"
 
 namespace {
 
@@ -28,13 +32,19 @@ const char kInstanceLock[] = "/var/run/fileindexd.pid";
 // Long enough that a crawl's commits (each writes out the name index's pending terms) stay
 // few, short enough that commands and signals wait little.
 const std::chrono::milliseconds kSliceBudget(200);
+// Where Samba's Elasticsearch backend looks by default.
+const char kSpotlightAddress[] = "127.0.0.1";
+const int kSpotlightPort = 9200;
 
 void Usage(FILE* out) {
-  std::fprintf(out,
-               "usage: fileindexd [--sysroot DIR] [--admin-group GROUP] [--log-stderr]\n"
-               "  --sysroot DIR        prefix every fixed path with DIR (sandboxes and tests)\n"
-               "  --admin-group GROUP  members of GROUP may send commands too (default: root only)\n"
-               "  --log-stderr         log to standard error as well as to syslog\n");
+  std::fprintf(
+      out,
+      "usage: fileindexd [--sysroot DIR] [--admin-group GROUP] [--spotlight-port PORT] [--log-stderr]\n"
+      "  --sysroot DIR          prefix every fixed path with DIR (sandboxes and tests)\n"
+      "  --admin-group GROUP    members of GROUP may send commands too (default: root only)\n"
+      "  --spotlight-port PORT  answer Samba's Spotlight searches on 127.0.0.1:PORT\n"
+      "                         (default 9200; 0: not at all)\n"
+      "  --log-stderr           log to standard error as well as to syslog\n");
 }
 
 }  // namespace
@@ -42,11 +52,13 @@ void Usage(FILE* out) {
 int main(int argc, char** argv) {
   static const struct option kOptions[] = {{"sysroot", required_argument, nullptr, 'r'},
                                            {"admin-group", required_argument, nullptr, 'g'},
+                                           {"spotlight-port", required_argument, nullptr, 'p'},
                                            {"log-stderr", no_argument, nullptr, 'e'},
                                            {"help", no_argument, nullptr, 'h'},
                                            {nullptr, 0, nullptr, 0}};
   std::string adminGroup;
   bool logStderr = false;
+  int spotlightPort = kSpotlightPort;
   int opt;
   while ((opt = ::getopt_long(argc, argv, "", kOptions, nullptr)) != -1) {
     switch (opt) {
@@ -59,6 +71,16 @@ int main(int argc, char** argv) {
       case 'e':
         logStderr = true;
         break;
+      case 'p': {
+        char* end = nullptr;
+        long port = std::strtol(optarg, &end, 10);
+        if (*optarg == '\0' || *end != '\0' || port < 0 || port > 65535) {
+          std::fprintf(stderr, "fileindexd: not a port: %s\n", optarg);
+          return 2;
+        }
+        spotlightPort = static_cast<int>(port);
+        break;
+      }
       case 'h':
         Usage(stdout);
         return 0;
@@ -116,6 +138,16 @@ int main(int argc, char** argv) {
   });
 
   fileindexd::IndexingService service(loop);
+  fileindexd::SpotlightSearch spotlight;
+  service.ObserveConfig([&spotlight](const std::map<std::string, fileindexd::ShareConfig>& shares) {
+    std::vector<fileindexd::SearchableShare> searchable;
+    for (const auto& entry : shares) {
+      fileindexd::SearchableShare share{entry.first, entry.second.directory, entry.second.dbDirectory, {}};
+      for (const auto& folder : entry.second.flags) share.folders.push_back(folder.first);
+      searchable.push_back(std::move(share));
+    }
+    spotlight.SetShares(std::move(searchable));
+  });
   std::string error;
   if (!service.Start(error)) {
     Log(LOG_ERR, "cannot start: %s", error.c_str());
@@ -126,6 +158,16 @@ int main(int argc, char** argv) {
   if (!server.Listen(fileindex_daemon::Rooted(kSocketPath), group, error)) {
     Log(LOG_ERR, "cannot listen: %s", error.c_str());
     return 1;
+  }
+  // Searches run on the endpoint's own threads, each with its own read-only view of an
+  // index, beside this loop and its writes.
+  fileindexd::SpotlightEndpoint endpoint(spotlight);
+  if (spotlightPort != 0) {
+    if (endpoint.Start(kSpotlightAddress, spotlightPort, error)) {
+      Log(LOG_INFO, "answering Spotlight searches on %s:%d", kSpotlightAddress, spotlightPort);
+    } else {
+      Log(LOG_ERR, "%s; Spotlight searches are not answered", error.c_str());
+    }
   }
   Log(LOG_INFO, "ready");
   fileindex_daemon::NotifyServiceManager("READY=1");
@@ -138,6 +180,7 @@ int main(int argc, char** argv) {
     if (service.HasRunnableWork()) service.RunSlice(kSliceBudget);
   }
   fileindex_daemon::NotifyServiceManager("STOPPING=1");
+  endpoint.Stop();
   Log(LOG_INFO, "stopped");
   return 0;
 }

@@ -1,9 +1,11 @@
 // Samba's Spotlight switch: the "spotlight" parameter of the [global] section of
-// smb.conf, edited in place. Everything else in the file (comments, blank lines, other
-// parameters and sections, continuation lines) is kept byte for byte.
+// smb.conf, with the Elasticsearch backend that the indexing daemon answers, edited in
+// place. Everything else in the file (comments, blank lines, other parameters and
+// sections, continuation lines) is kept byte for byte.
 #include <sys/stat.h>
 #include <tavo/platform.h>
 
+#include <algorithm>
 #include <cctype>
 #include <climits>
 #include <cstdlib>
@@ -113,7 +115,24 @@ bool IsTrue(const std::string& value) {
   return v == "yes" || v == "true" || v == "1" || v == "on";
 }
 
-bool IsSpotlight(const Line& line) { return line.parameter && line.global && line.key == "spotlight"; }
+// What Samba needs to send Spotlight searches to the indexing daemon's endpoint. The
+// backend is the switch's own; where to reach it (and how Finder's attributes map onto
+// fields) is kept when already set, so that a site may point Samba at a cluster instead.
+struct Parameter {
+  const char* name;
+  const char* value;
+  bool keepExisting;
+};
+const Parameter kBackend[] = {
+    {"spotlight backend", "elasticsearch", false},
+    {"elasticsearch:address", "127.0.0.1", true},
+    {"elasticsearch:port", "9200", true},
+    {"elasticsearch:mappings", "/usr/share/samba/mdssvc/elasticsearch_mappings.json", true},
+};
+
+bool IsGlobal(const Line& line, const char* name) {
+  return line.parameter && line.global && line.key == ParameterKey(name);
+}
 
 // Replaces the value of a parameter line, keeping its indentation and name as written.
 void SetValue(Line& line, const char* value) {
@@ -125,12 +144,12 @@ void SetValue(Line& line, const char* value) {
   line.value = value;
 }
 
-Line NewParameter(const std::string& indent, const char* value) {
+Line NewParameter(const std::string& indent, const char* name, const char* value) {
   Line line;
-  line.physical.push_back(indent + "spotlight = " + value);
+  line.physical.push_back(indent + name + " = " + value);
   line.parameter = true;
   line.global = true;
-  line.key = "spotlight";
+  line.key = ParameterKey(name);
   line.value = value;
   return line;
 }
@@ -143,7 +162,7 @@ std::string Indent(const Line& line) {
 // Adds the parameter after the last parameter of the first explicit [global] section
 // (after its header when it has none), else after the implicit global parameters at
 // the top of the file, else in a new [global] section before the first section.
-void AddSpotlight(Conf& conf, const char* value) {
+void AddGlobal(Conf& conf, const char* name, const char* value) {
   std::vector<Line>& lines = conf.lines;
   size_t firstHeader = lines.size();
   size_t globalHeader = lines.size();
@@ -166,13 +185,13 @@ void AddSpotlight(Conf& conf, const char* value) {
     }
   }
   if (after != lines.size()) {
-    lines.insert(lines.begin() + after + 1, NewParameter(indent, value));
+    lines.insert(lines.begin() + after + 1, NewParameter(indent, name, value));
     return;
   }
   Line section;
   section.physical.push_back("[global]");
   section.header = section.global = true;
-  std::vector<Line> added{section, NewParameter("\t", value)};
+  std::vector<Line> added{section, NewParameter("\t", name, value)};
   if (firstHeader != lines.size()) {
     Line blank;
     blank.physical.push_back("");
@@ -181,18 +200,45 @@ void AddSpotlight(Conf& conf, const char* value) {
   lines.insert(lines.begin() + firstHeader, added.begin(), added.end());
 }
 
+// Gives every global occurrence of the parameter the value (or only adds it when missing).
+void SetGlobal(Conf& conf, const char* name, const char* value, bool keepExisting) {
+  bool found = false;
+  for (Line& line : conf.lines) {
+    if (!IsGlobal(line, name)) continue;
+    if (!keepExisting) SetValue(line, value);
+    found = true;
+  }
+  if (!found) AddGlobal(conf, name, value);
+}
+
+void RemoveGlobal(Conf& conf, const char* name) {
+  auto& lines = conf.lines;
+  lines.erase(
+      std::remove_if(lines.begin(), lines.end(), [name](const Line& line) { return IsGlobal(line, name); }),
+      lines.end());
+}
+
+// The value Samba uses: the last one given.
+std::string GlobalValue(const Conf& conf, const char* name) {
+  std::string value;
+  for (const Line& line : conf.lines) {
+    if (IsGlobal(line, name)) value = line.value;
+  }
+  return value;
+}
+
 }  // namespace
 
-// Samba's default is off: a missing file or parameter reads as 0.
+// Samba's default is off: a missing file or parameter reads as 0. Spotlight answered by
+// anything but the Elasticsearch backend is no Spotlight for the indexing service.
 extern "C" int TAVOSMBIsEnableSpotlight(void) {
   std::string text;
   if (!tavo_host::ReadFile(ConfPath(), text)) return 0;
   Conf conf = Parse(text);
-  int enabled = 0;
-  for (const Line& line : conf.lines) {
-    if (IsSpotlight(line)) enabled = IsTrue(line.value) ? 1 : 0;  // the last one wins
-  }
-  return enabled;
+  return IsTrue(GlobalValue(conf, "spotlight")) &&
+                 Lower(GlobalValue(conf, "spotlight backend")) == "elasticsearch"
+             ? 1
+             : 0;
 }
 
 extern "C" int TAVOSMBSetSpotlight(int blEnable) {
@@ -212,16 +258,15 @@ extern "C" int TAVOSMBSetSpotlight(int blEnable) {
     TAVO_HOST_SET_ERROR(tavo_host::kErrSamba);
     return -1;
   }
-  const char* value = blEnable ? "yes" : "no";
   Conf conf = Parse(text);
-  bool found = false;
-  for (Line& line : conf.lines) {
-    if (IsSpotlight(line)) {
-      SetValue(line, value);
-      found = true;
+  SetGlobal(conf, "spotlight", blEnable ? "yes" : "no", false);
+  for (const Parameter& parameter : kBackend) {
+    if (blEnable) {
+      SetGlobal(conf, parameter.name, parameter.value, parameter.keepExisting);
+    } else {
+      RemoveGlobal(conf, parameter.name);
     }
   }
-  if (!found) AddSpotlight(conf, value);
   if (!tavo_host::WriteFileAtomic(path, Render(conf), mode)) {
     TAVO_HOST_SET_ERROR(tavo_host::kErrSamba);
     return -1;

@@ -244,7 +244,7 @@ std::string Notifier(const std::string& root) {
          " >> \"$root/var/log/notify.log\"\n";
 }
 
-int Init(Session& s, const std::string& dir, bool useProbe, bool force) {
+int Init(Session& s, const std::string& dir, bool useProbe, bool force, int spotlightPort) {
   if (!MakeDirs(dir)) {
     s.Fail("sandbox init", "cannot create " + dir + ": " + std::strerror(errno));
     return s.Finish(Json::Value(), nullptr);
@@ -276,8 +276,10 @@ int Init(Session& s, const std::string& dir, bool useProbe, bool force) {
         {"tavotifyd", Quote(notifier) + " --sysroot \"$root\" --foreground", "", "", "", false, ""});
     // The notification daemon comes with the indexing daemon, as a dependency would.
     const std::string hooks = root + "/etc/tavo/services/";
-    daemons.push_back({"fileindexd", Quote(daemonProgram) + " --sysroot \"$root\" --log-stderr", socket,
-                       Quote(hooks + "tavotifyd") + " start || exit 1", "", false, ""});
+    daemons.push_back({"fileindexd",
+                       Quote(daemonProgram) + " --sysroot \"$root\" --spotlight-port " +
+                           std::to_string(spotlightPort) + " --log-stderr",
+                       socket, Quote(hooks + "tavotifyd") + " start || exit 1", "", false, ""});
   }
   if (!IsExecutable(daemonProgram)) {
     s.Fail("sandbox init", useProbe ? "fileindex-probe not found; build it"
@@ -384,6 +386,7 @@ void AddSandboxCommands(CLI::App& app, Action& action) {
     std::string dir;
     bool probe = false;
     bool force = false;
+    int spotlightPort = 9200;
   };
   auto init = std::make_shared<InitArgs>();
   CLI::App* cmd = sandbox->add_subcommand(
@@ -393,8 +396,12 @@ void AddSandboxCommands(CLI::App& app, Action& action) {
       "--probe", init->probe,
       "Let the daemon probe stand in for the daemons: it logs each command to var/log/fileindexd.log");
   cmd->add_flag("--force", init->force, "Write over an existing sandbox");
+  cmd->add_option("--spotlight-port", init->spotlightPort,
+                  "Port of the indexing daemon's Spotlight endpoint on 127.0.0.1 (0: none)")
+      ->capture_default_str()
+      ->check(CLI::Range(0, 65535));
   cmd->callback([&action, init]() {
-    action = [init](Session& s) { return Init(s, init->dir, init->probe, init->force); };
+    action = [init](Session& s) { return Init(s, init->dir, init->probe, init->force, init->spotlightPort); };
   });
 
   auto names = std::make_shared<std::pair<std::string, std::string>>();

@@ -13,7 +13,8 @@
  *   /etc/tavo/services/<name>      optional executable hook of a service, run with "status"
  *                                  (exit 0 when running), "start", "stop" or "restart"; a
  *                                  non-zero exit fails the call.
- *   /etc/samba/smb.conf            Spotlight is the "spotlight" parameter of [global].
+ *   /etc/samba/smb.conf            Spotlight is the "spotlight" parameter of [global], with
+ *                                  the Elasticsearch backend that fileindexd answers.
  *   /run/tavotifyd/<queue name>/<queue path>.json
  *                                  the notification daemon's watch list of one queue.
  *
