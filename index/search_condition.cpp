@@ -131,6 +131,18 @@ std::string Phrase(const std::string& text) {
   return phrase + "\"";
 }
 
+std::string TextOf(sqlite3_value* value) {
+  const unsigned char* text = sqlite3_value_text(value);
+  return text != nullptr ? std::string(reinterpret_cast<const char*>(text),
+                                       static_cast<std::size_t>(sqlite3_value_bytes(value)))
+                         : std::string();
+}
+
+void FoldFunction(sqlite3_context* context, int, sqlite3_value** values) {
+  const std::string folded = FoldForMatching(TextOf(values[0]));
+  sqlite3_result_text(context, folded.data(), static_cast<int>(folded.size()), SQLITE_TRANSIENT);
+}
+
 void GlobFunction(sqlite3_context* context, int, sqlite3_value** values) {
   const unsigned char* glob = sqlite3_value_text(values[0]);
   const unsigned char* name = sqlite3_value_text(values[1]);
@@ -138,9 +150,36 @@ void GlobFunction(sqlite3_context* context, int, sqlite3_value** values) {
     sqlite3_result_int(context, 0);
     return;
   }
-  std::string folded = FoldForMatching(std::string(reinterpret_cast<const char*>(name),
-                                                   static_cast<std::size_t>(sqlite3_value_bytes(values[1]))));
-  sqlite3_result_int(context, GlobMatches(reinterpret_cast<const char*>(glob), folded) ? 1 : 0);
+  sqlite3_result_int(
+      context, GlobMatches(reinterpret_cast<const char*>(glob), FoldForMatching(TextOf(values[1]))) ? 1 : 0);
+}
+
+bool IsContinuation(unsigned char c) { return (c & 0xC0) == 0x80; }
+
+// The condition with what can never or always match folded away, so that the SQL keeps
+// the shapes SQLite plans with indexes ("0 OR x IN (...)" would be a scan of every row).
+Condition Simplified(const Condition& c) {
+  using T = Condition::Type;
+  if (c.type == T::kText) return Condition::Of(T::kNone);  // no extracted text is indexed yet
+  if (c.type != T::kAnd && c.type != T::kOr && c.type != T::kNot) return c;
+  Condition out = Condition::Of(c.type);
+  const T absorbing = c.type == T::kAnd ? T::kNone : T::kAll;  // decides the whole
+  const T neutral = c.type == T::kAnd ? T::kAll : T::kNone;    // changes nothing
+  for (const Condition& child : c.children) {
+    Condition simple = Simplified(child);
+    if (c.type == T::kNot) {
+      if (simple.type == T::kAll || simple.type == T::kNone)
+        return Condition::Of(simple.type == T::kAll ? T::kNone : T::kAll);
+      out.children.push_back(std::move(simple));
+      continue;
+    }
+    if (simple.type == absorbing) return Condition::Of(absorbing);
+    if (simple.type != neutral) out.children.push_back(std::move(simple));
+  }
+  if (c.type == T::kNot) return out;
+  if (out.children.empty()) return Condition::Of(neutral);
+  if (out.children.size() == 1) return std::move(out.children[0]);
+  return out;
 }
 
 // Builds the SQL of a condition, collecting the values it binds.
@@ -166,20 +205,23 @@ class SqlBuilder {
       case T::kNot:
         return c.children.size() == 1 ? "(NOT " + Build(c.children[0]) + ")" : "0";
       case T::kNameGlob: {
-        std::string glob = FoldForMatching(c.text);
-        std::string sql = "fi_glob(" + Text(glob) + ", e.name)";
-        std::string literal = GlobLiteralPrefix(glob);
-        // The name's first words begin with the glob's literal start: the full-text index
-        // finds those few rows, the glob then decides.
-        if (HasWordCharacter(literal))
-          sql = "(" + NameMatch("^" + Phrase(literal) + "*") + " AND " + sql + ")";
-        return sql;
+        // The folded names beginning with the glob's literal start are one range of an
+        // index; the glob itself decides only when it holds more than that start and '*'.
+        const std::string glob = FoldForMatching(c.text);
+        const std::string literal = GlobLiteralPrefix(glob);
+        if (glob == EscapeGlob(literal)) return "fi_fold(e.name) = " + Text(literal);
+        std::string sql;
+        if (!literal.empty())  // no UTF-8 byte reaches 0xff
+          sql = "fi_fold(e.name) >= " + Text(literal) + " AND fi_fold(e.name) < " + Text(literal + "\xff");
+        if (glob != EscapeGlob(literal) + "*")
+          sql += (sql.empty() ? "" : " AND ") + std::string("fi_glob(") + Text(glob) + ", e.name)";
+        return sql.empty() ? "1" : "(" + sql + ")";
       }
       case T::kWords:
         if (!HasWordCharacter(c.text) && !HasNonAscii(c.text)) return c.prefix && c.text.empty() ? "1" : "0";
         return NameMatch(Phrase(c.text) + (c.prefix ? "*" : ""));
       case T::kText:
-        return "0";  // no extracted text is indexed yet
+        return "0";  // no extracted text is indexed yet (see Simplified)
       case T::kContentType:
         return ContentType(c.text);
       case T::kSize:
@@ -263,8 +305,6 @@ class SqlBuilder {
   std::vector<Value> m_values;
 };
 
-bool IsContinuation(unsigned char c) { return (c & 0xC0) == 0x80; }
-
 }  // namespace
 
 const char* ContentTypeOfExtension(const std::string& extension) {
@@ -301,6 +341,15 @@ std::string FoldForMatching(const std::string& utf8) {
   std::string out;
   folded.toUTF8String(out);
   return out;
+}
+
+std::string EscapeGlob(const std::string& literal) {
+  std::string glob;
+  for (char c : literal) {
+    if (c == '*' || c == '?' || c == '\\') glob += '\\';
+    glob += c;
+  }
+  return glob;
 }
 
 std::string GlobLiteralPrefix(const std::string& glob) {
@@ -346,15 +395,17 @@ bool GlobMatches(const std::string& glob, const std::string& name) {
   return g == glob.size();
 }
 
+bool RegisterMatchingFunctions(sqlite3* db) {
+  const int flags = SQLITE_UTF8 | SQLITE_DETERMINISTIC | SQLITE_INNOCUOUS;
+  return sqlite3_create_function_v2(db, "fi_fold", 1, flags, nullptr, FoldFunction, nullptr, nullptr,
+                                    nullptr) == SQLITE_OK &&
+         sqlite3_create_function_v2(db, "fi_glob", 2, flags, nullptr, GlobFunction, nullptr, nullptr,
+                                    nullptr) == SQLITE_OK;
+}
+
 bool IndexReader::Select(const Condition& condition, const SelectOptions& options, Selection& out) {
-  if (!m_functionsRegistered) {
-    if (sqlite3_create_function_v2(m_db, "fi_glob", 2, SQLITE_UTF8 | SQLITE_DETERMINISTIC, nullptr,
-                                   GlobFunction, nullptr, nullptr, nullptr) != SQLITE_OK)
-      return Fail("select");
-    m_functionsRegistered = true;
-  }
   SqlBuilder builder;
-  std::string where = builder.Build(condition);
+  std::string where = builder.Build(Simplified(condition));
   if (options.folders != nullptr)
     where = "(" + where + " AND " + builder.In("e.folder", *options.folders) + ")";
   out.total = 0;

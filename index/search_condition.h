@@ -3,6 +3,8 @@
 #ifndef FILEINDEX_INDEX_SEARCH_CONDITION_H
 #define FILEINDEX_INDEX_SEARCH_CONDITION_H
 
+#include <sqlite3.h>
+
 #include <cstdint>
 #include <limits>
 #include <string>
@@ -63,8 +65,16 @@ bool ContentTypeMatches(const std::string& pattern, const std::string& contentTy
 // Case and accents folded away, for comparing names as people type them.
 std::string FoldForMatching(const std::string& utf8);
 
+// A glob matching exactly the literal text.
+std::string EscapeGlob(const std::string& literal);
+
 // The literal text a glob begins with, up to its first wildcard.
 std::string GlobLiteralPrefix(const std::string& glob);
+
+// Adds fi_fold(name) (FoldForMatching) and fi_glob(glob, name) (GlobMatches on the folded
+// name) to a connection. Every connection to an index needs them: one of its indexes is
+// built on fi_fold.
+bool RegisterMatchingFunctions(sqlite3* db);
 
 // Whether a folded name matches a folded glob (see kNameGlob).
 bool GlobMatches(const std::string& glob, const std::string& name);

@@ -26,6 +26,8 @@ const char kSchema[] =
     "CREATE UNIQUE INDEX IF NOT EXISTS entries_by_place ON entries(parent, name);"
     // Searches by content type count and page through one extension's files at a time.
     "CREATE INDEX IF NOT EXISTS entries_by_type ON entries(ext, is_dir);"
+    // Searches by the start of a name, case and accents ignored, take a range of this.
+    "CREATE INDEX IF NOT EXISTS entries_by_folded_name ON entries(fi_fold(name));"
     // Names only; the rows live in entries (an external-content index that the writer
     // keeps in step, statement by statement). Not by triggers: a statement that fires a
     // trigger opens a statement savepoint, and the full-text index writes out its pending
@@ -179,6 +181,10 @@ std::unique_ptr<IndexWriter> IndexWriter::Open(const std::string& dbDir, std::st
   }
   sqlite3_busy_timeout(db, kBusyTimeoutMs);
   const std::string pragmas = "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA foreign_keys=OFF;";
+  if (!RegisterMatchingFunctions(db)) {
+    error = file + ": " + sqlite3_errmsg(db);
+    return nullptr;
+  }
   if (!writer->Exec(pragmas.c_str()) || !writer->Exec(kSchema)) {
     error = file + ": " + writer->LastError();
     return nullptr;
@@ -367,6 +373,10 @@ std::unique_ptr<IndexReader> IndexReader::Open(const std::string& dbDir, std::st
     return nullptr;
   }
   sqlite3_busy_timeout(db, kBusyTimeoutMs);
+  if (!RegisterMatchingFunctions(db)) {
+    error = file + ": " + sqlite3_errmsg(db);
+    return nullptr;
+  }
   return reader;
 }
 

@@ -182,7 +182,6 @@ class IndexReader : public Database {
 
  private:
   using Database::Database;
-  bool m_functionsRegistered = false;
 };
 
 // The full-text query for a list of words: each word a quoted prefix phrase, all required.

@@ -133,16 +133,6 @@ class Lexer {
   std::size_t m_at = 0;
 };
 
-// Each glob character taken literally.
-std::string EscapedGlob(const std::string& literal) {
-  std::string glob;
-  for (char c : literal) {
-    if (c == '*' || c == '?' || c == '\\') glob += '\\';
-    glob += c;
-  }
-  return glob;
-}
-
 // Where a glob's first unescaped wildcard is; npos when it has none.
 std::size_t FirstWildcard(const std::string& glob) {
   for (std::size_t i = 0; i < glob.size(); ++i) {
@@ -335,7 +325,8 @@ class Parser {
       case Field::kDefault:
         return Words(value, phrase, out);
       case Field::kName:
-        out = Condition::Of(Type::kNameGlob, phrase ? EscapedGlob(value.literal) : value.glob);
+        out =
+            Condition::Of(Type::kNameGlob, phrase ? fileindex_store::EscapeGlob(value.literal) : value.glob);
         return true;
       case Field::kText:
         out = Condition::Of(Type::kText, value.literal);

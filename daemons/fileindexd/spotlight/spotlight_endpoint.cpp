@@ -34,7 +34,7 @@ SpotlightEndpoint::SpotlightEndpoint(const SpotlightSearch& search) : m_search(s
 
 SpotlightEndpoint::~SpotlightEndpoint() { Stop(); }
 
-bool SpotlightEndpoint::Start(const std::string& address, int port, std::string& error) {
+bool SpotlightEndpoint::Start(const std::string& address, int port, std::string& error, int* boundPort) {
   m_server.reset(new Server);
   httplib::Server& http = m_server->http;
   http.new_task_queue = [] { return new httplib::ThreadPool(kThreads); };
@@ -42,6 +42,9 @@ bool SpotlightEndpoint::Start(const std::string& address, int port, std::string&
   http.set_read_timeout(kIdleSeconds, 0);
   http.set_write_timeout(kIdleSeconds, 0);
   http.set_keep_alive_timeout(kIdleSeconds);
+  // An answer goes out in more than one write: without this, the client's delayed
+  // acknowledgement holds the last one back for tens of milliseconds.
+  http.set_tcp_nodelay(true);
 
   http.set_pre_routing_handler([this](const httplib::Request& request, httplib::Response& response) {
     std::string why;
@@ -69,11 +72,14 @@ bool SpotlightEndpoint::Start(const std::string& address, int port, std::string&
                                          : "no handler for " + request.method + " " + request.path));
   });
 
-  if (!http.bind_to_port(address, port)) {
+  const int bound =
+      port == 0 ? http.bind_to_any_port(address) : (http.bind_to_port(address, port) ? port : -1);
+  if (bound <= 0) {
     error = "cannot listen on " + address + ":" + std::to_string(port);
     m_server.reset();
     return false;
   }
+  if (boundPort != nullptr) *boundPort = bound;
   m_thread = std::thread([this] { m_server->http.listen_after_bind(); });
   return true;
 }

@@ -23,9 +23,9 @@ class SpotlightEndpoint {
   SpotlightEndpoint(const SpotlightEndpoint&) = delete;
   SpotlightEndpoint& operator=(const SpotlightEndpoint&) = delete;
 
-  // Binds address:port and serves on threads of its own. False, with error, when the
-  // port cannot be bound.
-  bool Start(const std::string& address, int port, std::string& error);
+  // Binds address:port (port 0: any free port, told in boundPort) and serves on threads
+  // of its own. False, with error, when the port cannot be bound.
+  bool Start(const std::string& address, int port, std::string& error, int* boundPort = nullptr);
   void Stop();
 
  private:
