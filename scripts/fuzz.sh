@@ -11,7 +11,7 @@ BUILD_DIR=${BUILD_DIR:-build-fuzz}
 CLANG_VERSION=${CLANG_VERSION:-14}
 TARGETS=("$@")
 if ((${#TARGETS[@]} == 0)); then
-  TARGETS=(fuzz_queue_line fuzz_folders_load fuzz_folder_conf fuzz_status fuzz_index_mgr)
+  TARGETS=(fuzz_queue_line fuzz_folders_load fuzz_folder_conf fuzz_status fuzz_index_mgr fuzz_query_string)
 fi
 
 cmake -S . -B "$BUILD_DIR" -DFILEINDEX_FUZZ=ON -DFILEINDEX_TESTS=OFF -DCMAKE_BUILD_TYPE=RelWithDebInfo \

@@ -450,9 +450,28 @@ bool ParseDate(const std::string& text, long long& first, long long& last) {
   return true;
 }
 
+bool IsUtf8(const std::string& text) {
+  for (std::size_t i = 0; i < text.size();) {
+    unsigned char c = static_cast<unsigned char>(text[i]);
+    std::size_t length = c < 0x80 ? 1 : (c >> 5) == 0x6 ? 2 : (c >> 4) == 0xE ? 3 : (c >> 3) == 0x1E ? 4 : 0;
+    if (length == 0 || i + length > text.size()) return false;
+    for (std::size_t k = 1; k < length; ++k) {
+      if ((static_cast<unsigned char>(text[i + k]) & 0xC0) != 0x80) return false;
+    }
+    i += length;
+  }
+  return true;
+}
+
 bool ParseQueryString(const std::string& query, Condition& out, std::string& error) {
   if (query.size() > kMaxQueryBytes) {
     error = "the query is longer than " + std::to_string(kMaxQueryBytes) + " bytes";
+    return false;
+  }
+  // Names are matched as text: a query that is not (a NUL, bytes that are not UTF-8) can
+  // match nothing and would only confuse what reads it.
+  if (query.find('\0') != std::string::npos || !IsUtf8(query)) {
+    error = "the query is not UTF-8 text";
     return false;
   }
   return Parser(query).Parse(out, error);

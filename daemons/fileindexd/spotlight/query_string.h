@@ -36,6 +36,9 @@ bool QueryScope(const fileindex_store::Condition& condition, std::string& path);
 // relative to it ("" for the share itself), outside it they match nothing.
 void ScopeToShare(fileindex_store::Condition& condition, const std::string& shareDirectory);
 
+// Whether text is well-formed UTF-8.
+bool IsUtf8(const std::string& text);
+
 // A date as Elasticsearch reads one ("2020-01-01", "2020-01-01T10:00:00Z", with an
 // optional fraction and offset): the first and last second it covers.
 bool ParseDate(const std::string& text, long long& first, long long& last);

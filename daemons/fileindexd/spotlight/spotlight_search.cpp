@@ -32,21 +32,6 @@ std::string Canonical(const std::string& path) {
   return ::realpath(path.c_str(), resolved) != nullptr ? std::string(resolved) : path;
 }
 
-// Samba parses the answer as JSON, which holds UTF-8 only: a name that is not cannot be
-// answered at all.
-bool IsUtf8(const std::string& text) {
-  for (std::size_t i = 0; i < text.size();) {
-    unsigned char c = static_cast<unsigned char>(text[i]);
-    std::size_t length = c < 0x80 ? 1 : (c >> 5) == 0x6 ? 2 : (c >> 4) == 0xE ? 3 : (c >> 3) == 0x1E ? 4 : 0;
-    if (length == 0 || i + length > text.size()) return false;
-    for (std::size_t k = 1; k < length; ++k) {
-      if ((static_cast<unsigned char>(text[i + k]) & 0xC0) != 0x80) return false;
-    }
-    i += length;
-  }
-  return true;
-}
-
 // Path scopes as the file system names them, so that a share reached through a link
 // still matches its directory.
 void CanonicalScopes(Condition& condition) {
@@ -172,7 +157,8 @@ SearchAnswer SpotlightSearch::Search(const std::string& index, const std::string
   for (const fileindex_store::Hit& hit : selection.hits) {
     const std::string path = share->canonicalDirectory + "/" + hit.path;
     struct stat st;
-    if (::lstat(path.c_str(), &st) != 0 || !IsUtf8(path)) continue;  // gone since it was indexed
+    // Gone since it was indexed; or a name that JSON, which holds UTF-8 only, cannot carry.
+    if (::lstat(path.c_str(), &st) != 0 || !IsUtf8(path)) continue;
     Json::Value entry;
     entry["_index"] = share->config.name;
     entry["_id"] = hit.path;
