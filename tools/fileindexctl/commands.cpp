@@ -1,8 +1,12 @@
 // Every public operation of the library as a command.
 #include "commands.h"
 
+#include <arpa/inet.h>
 #include <fileindex/fileindex.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
 #include <tavo/platform.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <climits>
@@ -250,6 +254,21 @@ CLI::App* Group(CLI::App& app, const std::string& name, const std::string& descr
 }
 
 // A yes/no answer of the library; "no" exits 3.
+// Where Samba's Elasticsearch backend looks by default, and fileindexd answers.
+const int kSpotlightPort = 9200;
+
+bool AcceptsConnections(const char* address, int port) {
+  int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) return false;
+  sockaddr_in to{};
+  to.sin_family = AF_INET;
+  to.sin_port = htons(static_cast<uint16_t>(port));
+  ::inet_pton(AF_INET, address, &to.sin_addr);
+  const bool accepted = ::connect(fd, reinterpret_cast<sockaddr*>(&to), sizeof(to)) == 0;
+  ::close(fd);
+  return accepted;
+}
+
 int Answer(Session& session, const std::string& operation, const std::string& subject,
            const std::string& question, const std::function<bool()>& ask) {
   bool answer = session.Ask(operation, ask);
@@ -771,6 +790,31 @@ void AddShareCommands(CLI::App& app, Action& action) {
                       [&]() { return FI::IndexMgr::IsShareIndexed(indexed->name); });
       });
   cmd->add_option("share", indexed->name, "Share name")->required();
+
+  // Spotlight is one switch for every share: Samba's, set by the library when the first
+  // folder is indexed. Finder's searches need the indexing daemon's endpoint too.
+  auto spotlight = std::make_shared<int>(kSpotlightPort);
+  cmd = Command(*share, "spotlight", "Whether Samba's Spotlight is on and its searches are answered", action,
+                [spotlight](Session& s) {
+                  bool on =
+                      s.Ask("TAVOSMBIsEnableSpotlight", []() { return TAVOSMBIsEnableSpotlight() == 1; });
+                  const std::string endpoint = "127.0.0.1:" + std::to_string(*spotlight);
+                  const bool answering = AcceptsConnections("127.0.0.1", *spotlight);
+                  Json::Value result;
+                  result["spotlight"] = on;
+                  result["endpoint"] = endpoint;
+                  result["answering"] = answering;
+                  return s.Finish(
+                      result,
+                      [&]() {
+                        std::printf("spotlight: %s (smb.conf)\nendpoint %s: %s\n", on ? "on" : "off",
+                                    endpoint.c_str(), answering ? "answering" : "not answering");
+                      },
+                      !(on && answering));
+                });
+  cmd->add_option("--port", *spotlight, "The endpoint's port (fileindexd --spotlight-port)")
+      ->capture_default_str()
+      ->check(CLI::Range(1, 65535));
 
   auto canIndex = std::make_shared<ShareArgs>();
   cmd = Command(
