@@ -97,6 +97,25 @@ ctl search track BEACH --limit 3
 ctl search --kind video sunset --limit 3
 ctl search notes --share photo --limit 3
 
+step "macOS Finder searches the shares through Samba: Spotlight answered by fileindexd"
+ctl share spotlight
+if [ "$(id -u)" != 0 ] || ! command -v smbd >/dev/null || ! command -v mdsearch >/dev/null; then
+  say "(skipped: needs root and Debian's samba and smbclient packages)"
+elif (exec 3<>/dev/tcp/127.0.0.1/445) 2>/dev/null; then
+  say "(skipped: an SMB server already listens on port 445)"
+else
+  # Samba's user must reach the share; smbd and the helpers it starts live in a process
+  # namespace of their own and end with it.
+  chmod a+rX "$SANDBOX" "$SANDBOX/volume1" && chmod -R a+rX "$SANDBOX/volume1/photo"
+  unshare --pid --fork --mount-proc bash -c '
+    source scripts/samba-spotlight.sh
+    trap samba_cleanup EXIT
+    samba_start "$1/samba" "$1" photo "$1/volume1/photo" || exit 1
+    echo "\$ mdsearch 127.0.0.1 photo '"'"'kMDItemFSName==\"sunset*\" && kMDItemContentType==\"public.jpeg\"'"'"'"
+    samba_search photo "kMDItemFSName==\"sunset*\" && kMDItemContentType==\"public.jpeg\"" | head -4 | sed "s/^/  /"
+  ' _ "$SANDBOX" || say "(Samba could not be started; see $SANDBOX/samba/log)"
+fi
+
 step "A new file is found within moments"
 : > "$SANDBOX/volume1/photo/2020/lighthouse.jpg"
 wait_search found /photo/2020/lighthouse.jpg lighthouse

@@ -25,15 +25,14 @@ fi
 ip link set lo up
 work=$(mktemp -d /tmp/fileindex-samba.XXXXXX)
 chmod 755 "$work"
-user=fidx-mdsearch
-created_user=0
+source "$(dirname "$self")/../../scripts/samba-spotlight.sh"
 cleanup() {
   status=$?
   if [ $status -ne 0 ]; then
     echo "--- fileindexd.log"; tail -n 30 "$work/root/var/log/fileindexd.log" 2>/dev/null || true
     echo "--- rpcd_mdssvc log"; tail -n 30 "$work/samba/log/log.rpcd_mdssvc" 2>/dev/null || true
   fi
-  [ $created_user = 1 ] && userdel "$user" 2>/dev/null
+  samba_cleanup
   rm -rf "$work"
   exit $status
 }
@@ -63,41 +62,8 @@ fctl folders add /photo/2020 --photo --document --audio --video >/dev/null
 grep -q "spotlight backend = elasticsearch" "$root/etc/samba/smb.conf" ||
   fail "the library did not switch Spotlight on in smb.conf"
 
-# smbd with every directory of its own, reading the sandbox's smb.conf for Spotlight.
-samba="$work/samba"
-mkdir -p "$samba"/{private,lock,state,cache,pid,ncalrpc,log}
-cat >"$samba/smb.conf" <<EOF
-[global]
-	private dir = $samba/private
-	lock directory = $samba/lock
-	state directory = $samba/state
-	cache directory = $samba/cache
-	pid directory = $samba/pid
-	ncalrpc dir = $samba/ncalrpc
-	interfaces = lo
-	bind interfaces only = yes
-	disable netbios = yes
-	smb ports = 445
-	include = $root/etc/samba/smb.conf
-[photo]
-	path = $share
-	read only = yes
-	elasticsearch:max results = 50
-EOF
-if ! id "$user" >/dev/null 2>&1; then
-  useradd --system --no-create-home --shell /usr/sbin/nologin "$user"
-  created_user=1
-fi
-printf 'secret\nsecret\n' | smbpasswd -c "$samba/smb.conf" -a -s "$user" >/dev/null
-smbd -F -s "$samba/smb.conf" -l "$samba/log" </dev/null &
-for _ in $(seq 100); do
-  (exec 3<>/dev/tcp/127.0.0.1/445) 2>/dev/null && break
-  sleep 0.1
-done
-
-search() {
-  timeout 20 mdsearch -s "$samba/smb.conf" -U "$user%secret" 127.0.0.1 photo "$1" 2>&1 | sort
-}
+samba_start "$work/samba" "$root" photo "$share"
+search() { samba_search photo "$1"; }
 expect() {  # query, expected paths (one per line, sorted)
   local got
   got=$(search "$1")
@@ -152,3 +118,9 @@ ask() {  # user
 [ "$(ask 0)" = "HTTP/1.1 200 OK" ] || fail "root was not answered: $(ask 0)"
 [ "$(ask 65534)" = "HTTP/1.1 403 Forbidden" ] || fail "another user was answered: $(ask 65534)"
 echo "ok: root answered, another user refused"
+
+# The daemon ends cleanly, and under the sanitizers without a report.
+fctl sandbox stop >/dev/null
+if grep -E "runtime error|AddressSanitizer|LeakSanitizer" "$root/var/log/fileindexd.log"; then
+  fail "a sanitizer report in fileindexd's log"
+fi
