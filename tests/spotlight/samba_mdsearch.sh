@@ -19,6 +19,10 @@ if [ "${2:-}" != --inside ]; then
   for tool in smbd mdsearch smbpasswd unshare ip setpriv; do
     command -v "$tool" >/dev/null || { echo "missing $tool: install samba, smbclient, iproute2 (scripts/install-deps.sh)" >&2; exit 1; }
   done
+  if ! unshare --net --pid --fork --mount-proc true 2>/dev/null; then
+    echo "skipped: this machine does not allow private network and process namespaces"
+    exit 77
+  fi
   exec timeout --kill-after=5 240 unshare --net --pid --fork --mount-proc "$self" "$build" --inside
 fi
 
