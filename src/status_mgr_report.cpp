@@ -5,6 +5,7 @@
 #include <fileindex/status_mgr.h>
 #include <fileindex/utils.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
@@ -89,15 +90,23 @@ inline bool SameBytes(const char* a, const char* b, size_t n) {
 // The folders of one queue read, each a full path followed by "/": which of them an
 // event's path lies in, that is whether "path" + "/" starts with the folder + "/" (the
 // event concerns the folder itself or something inside it, on whole path components).
-// The bytes that all the folders share are compared once per path.
+// The bytes that all the folders share are compared once per path, and the byte after
+// a folder's length once for all the folders of that length; each folder's last eight
+// bytes, as one word, rule it out before its own comparison.
 class FolderSet {
  public:
   explicit FolderSet(const std::vector<std::string>& folderSlashes) : folders_(folderSlashes) {
     common_ = folders_.empty() ? 0 : folders_[0].size() - 1;
-    for (const std::string& folder : folders_) {
+    for (size_t i = 0; i < folders_.size(); ++i) {
+      const std::string& folder = folders_[i];
       size_t n = 0;
       while (n < common_ && n + 1 < folder.size() && folder[n] == folders_[0][n]) ++n;
       common_ = n;
+      const size_t size = folder.size() - 1;
+      auto group =
+          std::find_if(groups_.begin(), groups_.end(), [size](const Group& g) { return g.size == size; });
+      if (group == groups_.end()) group = groups_.insert(groups_.end(), Group{size, {}});
+      group->members.push_back(Member{i, size >= 8 ? Word(folder.data() + size - 8) : 0});
     }
   }
 
@@ -105,22 +114,38 @@ class FolderSet {
   size_t Mark(const char* path, size_t size, std::vector<char>& found) const {
     if (size < common_ || !SameBytes(path, folders_[0].data(), common_)) return 0;
     size_t marked = 0;
-    for (size_t i = 0; i < folders_.size(); ++i) {
-      if (found[i]) continue;
-      const std::string& folder = folders_[i];
-      const size_t n = folder.size() - 1;
-      // The byte after the folder's length rules out most paths before the comparison.
+    for (const Group& group : groups_) {
+      const size_t n = group.size;
       if (size < n || (size > n && path[n] != '/')) continue;
-      if (SameBytes(path + common_, folder.data() + common_, n - common_)) {
-        found[i] = 1;
-        ++marked;
+      const uint64_t tail = n >= 8 ? Word(path + n - 8) : 0;
+      for (const Member& member : group.members) {
+        if (member.tail != tail || found[member.index]) continue;
+        if (SameBytes(path + common_, folders_[member.index].data() + common_, n - common_)) {
+          found[member.index] = 1;
+          ++marked;
+        }
       }
     }
     return marked;
   }
 
  private:
+  struct Member {
+    size_t index;
+    uint64_t tail;  // the folder's last eight bytes, when it has eight
+  };
+  struct Group {
+    size_t size;  // the length of its folders, without the "/"
+    std::vector<Member> members;
+  };
+  static uint64_t Word(const char* p) {
+    uint64_t word;
+    std::memcpy(&word, p, 8);
+    return word;
+  }
+
   const std::vector<std::string>& folders_;
+  std::vector<Group> groups_;
   size_t common_;
 };
 

@@ -186,9 +186,11 @@ TEST(QueueLineDifferential, RunsReadAsLineByLine) {
     std::string text;
     for (size_t n = rng() % 200; n > 0; --n) text += CompactLine(rng, "/volume1/photo/2019") + "\n";
     if (rng() % 2) text += CompactLine(rng, "/v");
-    const char* const end = text.data() + text.size();
-    internal::QueueRunClassifier run(text.data(), end);
-    for (const char* line = text.data(); line < end; ++lines) {
+    // In a buffer of exactly its size, so that the sanitizers see any read past the run.
+    const std::vector<char> exact(text.begin(), text.end());
+    const char* const end = exact.data() + exact.size();
+    internal::QueueRunClassifier run(exact.data(), end);
+    for (const char* line = exact.data(); line < end; ++lines) {
       internal::QueueEventView byRun, alone;
       const char *runEnd = nullptr, *aloneEnd = nullptr;
       const QueueLineKind kind = run.Classify(line, byRun, runEnd);

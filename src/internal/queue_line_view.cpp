@@ -245,6 +245,12 @@ class Reader {
   // The line starts at begin and ends at the first newline before limit, or at limit.
   Reader(const char* begin, const char* limit) : begin_(begin), end_(limit) {}
 
+  // At the opening quote of a string member that is read: the position after its closing
+  // quote, or null; value and size as Member gives them.
+  const char* ReadMember(const char* p, const char*& value, size_t& size, std::string& storage) const {
+    return Member(p, value, size, storage);
+  }
+
   QueueLineKind Line(QueueEventView& out, const char*& lineEnd) const {
     if (Canonical(out, lineEnd)) return QueueLineKind::kEvent;
     // What the attempt above left is forgotten: the general reading starts afresh.
@@ -305,7 +311,7 @@ class Reader {
   // digit: their count differs from line to line.
   FIDX_HOT const char* EventDigits(const char* p, uint64_t& value) const {
     const size_t n = DigitRun(p);
-    // At most 10 digits fit; and a line is only read here while 24 bytes follow its start.
+    // At most 10 digits fit; and the conversion reads 8 bytes from p, 16 must follow.
     if (n == 0 || n > 10 || (n > 1 && *p == '0') || end_ - p < 16) return nullptr;
     if (n <= 8) {
       value = EightDigits(p, n);
@@ -714,9 +720,9 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
   }
   // Each step reads at most kReach bytes from a position before limit.
   const char* const limit = line + kSpan - kReach;
-  // The first quote, backslash or newline in [p, limit): a string's end when it is a
-  // quote, else the line is not read here.
-  auto stringEnd = [&](const char* p) -> const char* {
+  // The first quote, backslash or newline in [p, limit); stringEnd takes only a quote,
+  // the end of a string without escapes.
+  auto firstStop = [&](const char* p) -> const char* {
     const size_t at = static_cast<size_t>(p - window_);
     size_t word = at / 64;
     uint64_t mask = masks_[word] & (~uint64_t(0) << (at % 64));
@@ -726,7 +732,11 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
       mask = masks_[word];
     }
     const char* stop = window_ + word * 64 + __builtin_ctzll(mask);
-    return stop < limit && *stop == '"' ? stop : nullptr;
+    return stop < limit ? stop : nullptr;
+  };
+  auto stringEnd = [&](const char* p) -> const char* {
+    const char* stop = firstStop(p);
+    return stop != nullptr && *stop == '"' ? stop : nullptr;
   };
   // A number as the general reading takes it: no leading zero, no fraction or exponent,
   // at most 15 digits here.
@@ -754,21 +764,27 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
   // A comma here also rules out a fraction or an exponent.
   if (!Equals(p, kPath)) return false;
   p += sizeof(kPath) - 1;
-  const char* stop = stringEnd(p);
-  if (stop == nullptr) return false;
-  out.path = p;
-  out.pathSize = static_cast<size_t>(stop - p);
+  // A path member from the first byte of its text: the position after its closing quote,
+  // or null. One with escapes is read and decoded as the general reading does.
+  auto member = [&](const char* p, const char*& value, size_t& size, std::string& storage) -> const char* {
+    const char* stop = firstStop(p);
+    if (stop == nullptr || *stop == '\n') return nullptr;
+    if (*stop == '"') {
+      value = p;
+      size = static_cast<size_t>(stop - p);
+      return stop + 1;
+    }
+    stop = Reader(line, end_).ReadMember(p - 1, value, size, storage);
+    return stop != nullptr && stop < limit ? stop : nullptr;
+  };
   out.pathOld = nullptr;
   out.pathOldSize = 0;
-  p = stop + 1;
+  p = member(p, out.path, out.pathSize, out.pathStorage);
+  if (p == nullptr) return false;
   if (*p == ',') {
     if (Equals(p, kPathOld)) {
-      p += sizeof(kPathOld) - 1;
-      stop = stringEnd(p);
-      if (stop == nullptr) return false;
-      out.pathOld = p;
-      out.pathOldSize = static_cast<size_t>(stop - p);
-      p = stop + 1;
+      p = member(p + sizeof(kPathOld) - 1, out.pathOld, out.pathOldSize, out.pathOldStorage);
+      if (p == nullptr) return false;
     } else if (Equals(p, kData)) {
       p += sizeof(kData) - 1;
       if (*p != '{') {
@@ -778,6 +794,7 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
       } else {
         // A flat object of plain members; anything nested or escaped is left to the
         // general reading.
+        const char* stop;
         for (;;) {
           if (*p != '"' || (stop = stringEnd(p + 1)) == nullptr || stop[1] != ':') return false;
           p = stop + 2;
