@@ -138,7 +138,7 @@ std::string CompactLine(std::mt19937_64& rng, const std::string& folder) {
   auto oneOf = [&rng](const std::vector<std::string>& items) { return items[rng() % items.size()]; };
   auto path = [&] {
     return "\"" + folder +
-           oneOf({"", "/a", "/" + std::string(rng() % 300, 'x'), "/\\\"", "/\\u00e9", "/\t\x01\xff", "/a\0b"s,
+           oneOf({"", "/a", "/" + std::string(rng() % 600, 'x'), "/\\\"", "/\\u00e9", "/\t\x01\xff", "/a\0b"s,
                   "/a\"", "/\\"}) +
            "\"";
   };
@@ -163,7 +163,7 @@ std::string CompactLine(std::mt19937_64& rng, const std::string& folder) {
                                   R"({"path":"/x","event":1})",
                                   R"({"a\u0062":1})",
                                   R"({"":"")",
-                                  "{\"a\":\"" + std::string(rng() % 300, 'd') + "\"}"});
+                                  "{\"a\":\"" + std::string(rng() % 600, 'd') + "\"}"});
   std::string line = "{\"event\":" +
                      oneOf({"2", "256", "65536", "0", "4294967295", "4294967296", "12345678901", "01", "-1",
                             "1.5", "2e1", "9"}) +

@@ -694,7 +694,7 @@ void ComputeStopMasks(const char* p, size_t words, uint64_t* out) {
 
 // The longest line read from the masks, and what every step below may read after its
 // position: no read reaches kSpan bytes past the line's start.
-const size_t kSpan = 256;
+const size_t kSpan = 512;
 const size_t kReach = 24;
 
 }  // namespace
