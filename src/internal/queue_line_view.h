@@ -61,7 +61,7 @@ class QueueRunClassifier {
   QueueRunClassifier(const char* data, const char* end) : end_(end), window_(data), windowEnd_(data) {}
 
   // What ClassifyQueueLine(line, end, out, lineEnd) answers, for line at the start of a
-  // line of the run and not before the line asked last.
+  // line of the run; asked front to back, the masks are computed once.
   QueueLineKind Classify(const char* line, QueueEventView& out, const char*& lineEnd) {
     if (Common(line, out, lineEnd)) return QueueLineKind::kEvent;
     return ClassifyQueueLine(line, end_, out, lineEnd);
@@ -71,7 +71,8 @@ class QueueRunClassifier {
   // The masks cover this many 64-byte words from window_.
   static const size_t kWords = 128;
 
-  // True when the line is the daemon's own compact form without escapes, out then read.
+  // True when the line is in the daemon's own compact form (escapes only in its paths),
+  // out then read; false leaves the line to ClassifyQueueLine.
   bool Common(const char* line, QueueEventView& out, const char*& lineEnd);
   // Masks for the bytes from at on, as many words as the run has left.
   void Fill(const char* at);
