@@ -270,6 +270,36 @@ inline std::string CheckQueueLine(const std::string& line) {
   return std::string();
 }
 
+#ifdef FILEINDEX_FUZZ_HAVE_LINE_VIEW
+// The bytes as one run of lines: the run reader answers for every line what
+// ClassifyQueueLine answers, with the same values and line end for an event.
+inline std::string CheckQueueRun(const uint8_t* data, size_t size) {
+  // The fuzzer's own buffer, of exactly its size: a read past the run is seen.
+  const char* const begin = reinterpret_cast<const char*>(data);
+  const char* const end = begin + size;
+  fi::internal::QueueRunClassifier run(begin, end);
+  for (const char* line = begin; line < end;) {
+    fi::internal::QueueEventView byRun, alone;
+    const char* runEnd = nullptr;
+    const char* aloneEnd = nullptr;
+    const fi::internal::QueueLineKind kind = run.Classify(line, byRun, runEnd);
+    const char* next = std::find(line, end, '\n');
+    if (kind != fi::internal::ClassifyQueueLine(line, end, alone, aloneEnd))
+      return "QueueRunClassifier decides otherwise than ClassifyQueueLine: " + Show(std::string(line, next));
+    if (kind == fi::internal::QueueLineKind::kEvent &&
+        (runEnd != aloneEnd || byRun.event != alone.event ||
+         std::string(byRun.path, byRun.pathSize) != std::string(alone.path, alone.pathSize) ||
+         (byRun.pathOld != nullptr) != (alone.pathOld != nullptr) ||
+         (byRun.pathOld != nullptr &&
+          std::string(byRun.pathOld, byRun.pathOldSize) != std::string(alone.pathOld, alone.pathOldSize)))) {
+      return "QueueRunClassifier reads other values than ClassifyQueueLine: " + Show(std::string(line, next));
+    }
+    line = next < end ? next + 1 : end;
+  }
+  return std::string();
+}
+#endif
+
 // The bytes as the photo share's queue file: the line splitting, every line, the folder
 // status of /photo/a and the absorption of a settings event by a pending reindex.
 inline std::string CheckQueueFile(const Env& env, const uint8_t* data, size_t size) {

@@ -5,6 +5,7 @@
 #include <fileindex/status_mgr.h>
 #include <fileindex/utils.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
@@ -12,6 +13,10 @@
 #include <set>
 #include <string>
 #include <vector>
+
+#ifdef __SSE2__
+#include <emmintrin.h>
+#endif
 
 #include "internal/listing_pass.h"
 #include "internal/log.h"
@@ -49,17 +54,100 @@ bool IsPaused(long long resumeTime) {
   return static_cast<int64_t>(std::time(nullptr)) < static_cast<int64_t>(resumeTime);
 }
 
-// Whether "path" + "/" starts with folder + "/": the event concerns the folder itself or
-// something inside it, on whole path components. folderSlash already ends in "/".
-inline bool LiesIn(const char* path, size_t size, const std::string& folderSlash) {
-  const size_t n = folderSlash.size() - 1;
-  // The byte after the folder's length rules out most paths before the comparison.
-  if (size < n || (size > n && path[n] != '/')) return false;
-  if (n == 0) return true;
-  // Sibling folders differ mostly in their last name's last byte: checked before the
-  // whole comparison, which is an out-of-line call.
-  return path[n - 1] == folderSlash[n - 1] && std::memcmp(path, folderSlash.data(), n) == 0;
+// Whether the n bytes at a and b are the same: 16 at a time without a call, and without
+// a branch on where they differ (most paths share the folders' long common start).
+inline bool SameBytes(const char* a, const char* b, size_t n) {
+#ifdef __SSE2__
+  if (n >= 16) {
+    unsigned differ = 0;
+    size_t i = 0;
+    for (; i + 16 < n; i += 16) {
+      const __m128i x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(a + i));
+      const __m128i y = _mm_loadu_si128(reinterpret_cast<const __m128i*>(b + i));
+      differ |= static_cast<unsigned>(_mm_movemask_epi8(_mm_cmpeq_epi8(x, y))) ^ 0xFFFFu;
+    }
+    // The last 16 bytes, overlapping what was compared already.
+    const __m128i x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(a + n - 16));
+    const __m128i y = _mm_loadu_si128(reinterpret_cast<const __m128i*>(b + n - 16));
+    differ |= static_cast<unsigned>(_mm_movemask_epi8(_mm_cmpeq_epi8(x, y))) ^ 0xFFFFu;
+    return differ == 0;
+  }
+#endif
+  // Shorter runs, such as what tells sibling folders apart, as two overlapping words.
+  auto word = [](const char* p, size_t size) {
+    uint64_t value = 0;
+    std::memcpy(&value, p, size);
+    return value;
+  };
+  if (n >= 8) return ((word(a, 8) ^ word(b, 8)) | (word(a + n - 8, 8) ^ word(b + n - 8, 8))) == 0;
+  if (n >= 4) return ((word(a, 4) ^ word(b, 4)) | (word(a + n - 4, 4) ^ word(b + n - 4, 4))) == 0;
+  for (size_t i = 0; i < n; ++i) {
+    if (a[i] != b[i]) return false;
+  }
+  return true;
 }
+
+// The folders of one queue read, each a full path followed by "/": which of them an
+// event's path lies in, that is whether "path" + "/" starts with the folder + "/" (the
+// event concerns the folder itself or something inside it, on whole path components).
+// The bytes that all the folders share are compared once per path, and the byte after
+// a folder's length once for all the folders of that length; each folder's last eight
+// bytes, as one word, rule it out before its own comparison.
+class FolderSet {
+ public:
+  explicit FolderSet(const std::vector<std::string>& folderSlashes) : folders_(folderSlashes) {
+    common_ = folders_.empty() ? 0 : folders_[0].size() - 1;
+    for (size_t i = 0; i < folders_.size(); ++i) {
+      const std::string& folder = folders_[i];
+      size_t n = 0;
+      while (n < common_ && n + 1 < folder.size() && folder[n] == folders_[0][n]) ++n;
+      common_ = n;
+      const size_t size = folder.size() - 1;
+      auto group =
+          std::find_if(groups_.begin(), groups_.end(), [size](const Group& g) { return g.size == size; });
+      if (group == groups_.end()) group = groups_.insert(groups_.end(), Group{size, {}});
+      group->members.push_back(Member{i, size >= 8 ? Word(folder.data() + size - 8) : 0});
+    }
+  }
+
+  // Marks in found[i] each folder that the path lies in; how many were not marked yet.
+  size_t Mark(const char* path, size_t size, std::vector<char>& found) const {
+    if (size < common_ || !SameBytes(path, folders_[0].data(), common_)) return 0;
+    size_t marked = 0;
+    for (const Group& group : groups_) {
+      const size_t n = group.size;
+      if (size < n || (size > n && path[n] != '/')) continue;
+      const uint64_t tail = n >= 8 ? Word(path + n - 8) : 0;
+      for (const Member& member : group.members) {
+        if (member.tail != tail || found[member.index]) continue;
+        if (SameBytes(path + common_, folders_[member.index].data() + common_, n - common_)) {
+          found[member.index] = 1;
+          ++marked;
+        }
+      }
+    }
+    return marked;
+  }
+
+ private:
+  struct Member {
+    size_t index;
+    uint64_t tail;  // the folder's last eight bytes, when it has eight
+  };
+  struct Group {
+    size_t size;  // the length of its folders, without the "/"
+    std::vector<Member> members;
+  };
+  static uint64_t Word(const char* p) {
+    uint64_t word;
+    std::memcpy(&word, p, 8);
+    return word;
+  }
+
+  const std::vector<std::string>& folders_;
+  std::vector<Group> groups_;
+  size_t common_;
+};
 
 bool QueuePresent(const std::string& queuePath) {
   return IsFileExist(queuePath) || IsFileExist(queuePath + ".tmp");
@@ -79,15 +167,13 @@ template <typename OnMalformed>
 void ScanQueue(internal::QueueLineReader& reader, const std::vector<std::string>& folderSlashes,
                std::vector<char>& found, OnMalformed&& malformed) {
   found.assign(folderSlashes.size(), 0);
+  const FolderSet folders(folderSlashes);
+  size_t unfound = folderSlashes.size();
   auto mark = [&](const char* path, size_t size, unsigned code, const char* pathOld, size_t pathOldSize) {
-    for (size_t i = 0; i < folderSlashes.size(); ++i) {
-      if (found[i]) continue;
-      // Another code's old path is not read: it lies in no folder.
-      if (LiesIn(path, size, folderSlashes[i]) ||
-          (code == kRenameEvent && pathOld != nullptr && LiesIn(pathOld, pathOldSize, folderSlashes[i]))) {
-        found[i] = 1;
-      }
-    }
+    if (unfound == 0) return;
+    unfound -= folders.Mark(path, size, found);
+    // Another code's old path is not read: it lies in no folder.
+    if (code == kRenameEvent && pathOld != nullptr) unfound -= folders.Mark(pathOld, pathOldSize, found);
   };
   internal::QueueEventView view;
   internal::QueueEvent event;
@@ -96,9 +182,10 @@ void ScanQueue(internal::QueueLineReader& reader, const std::vector<std::string>
   // Whole runs of lines: the fast reader finds where each line ends as it reads it.
   while (reader.NextLines(data, size)) {
     const char* const end = data + size;
+    internal::QueueRunClassifier run(data, end);
     for (const char* line = data; line < end;) {
       const char* lineEnd = nullptr;
-      const internal::QueueLineKind kind = internal::ClassifyQueueLine(line, end, view, lineEnd);
+      const internal::QueueLineKind kind = run.Classify(line, view, lineEnd);
       if (kind == internal::QueueLineKind::kEvent) {
         mark(view.path, view.pathSize, view.event, view.pathOld, view.pathOldSize);
       } else {

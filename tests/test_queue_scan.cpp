@@ -4,6 +4,7 @@
 #include <fileindex/utils.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <random>
 
 #include "internal/json_io.h"
@@ -129,6 +130,86 @@ TEST(QueueLineDifferential, HandPickedAndGeneratedLinesReadAsTheParserReadsThem)
   }
   EXPECT_TRUE(valid > kLines / 5 && valid < kLines * 4 / 5) << valid;
   EXPECT_TRUE(events > valid / 5 && refused > (kLines - valid) / 5) << events << " " << refused;
+}
+
+// Lines in the daemon's own compact form and near misses of it, for the run reader: numbers at the
+// edges, escapes and raw bytes in names, flat and nested "data", blanks and bytes after the object.
+std::string CompactLine(std::mt19937_64& rng, const std::string& folder) {
+  auto oneOf = [&rng](const std::vector<std::string>& items) { return items[rng() % items.size()]; };
+  auto path = [&] {
+    return "\"" + folder +
+           oneOf({"", "/a", "/" + std::string(rng() % 600, 'x'), "/\\\"", "/\\u00e9", "/\t\x01\xff", "/a\0b"s,
+                  "/a\"", "/\\"}) +
+           "\"";
+  };
+  const std::string data = oneOf({"null",
+                                  "true",
+                                  "false",
+                                  "nul",
+                                  "{}",
+                                  R"({"inode":1,"size":-0,"mtime":123456789012345})",
+                                  R"({"a":01})",
+                                  R"({"a":1e5})",
+                                  R"({"a":1.0})",
+                                  R"({"a":1234567890123456})",
+                                  R"({"a":-})",
+                                  R"({"a":"s","b":true,"c":null,"d":false})",
+                                  R"({"a":"\""})",
+                                  R"({"a":[1]})",
+                                  R"({"a":{}})",
+                                  R"({"a":1,})",
+                                  R"({"a" :1})",
+                                  R"({"a":truex})",
+                                  R"({"path":"/x","event":1})",
+                                  R"({"a\u0062":1})",
+                                  R"({"":"")",
+                                  "{\"a\":\"" + std::string(rng() % 600, 'd') + "\"}"});
+  std::string line = "{\"event\":" +
+                     oneOf({"2", "256", "65536", "0", "4294967295", "4294967296", "12345678901", "01", "-1",
+                            "1.5", "2e1", "9"}) +
+                     ",\"path\":" + path() +
+                     oneOf({"", "", ",\"path_old\":" + path(), ",\"data\":" + data, ",\"data\":" + data,
+                            ",\"data\":" + data + ",\"x\":1", ",\"path_old\":7", ",\"path\":" + path()}) +
+                     "}" + oneOf({"", "", "", " ", "\r", "x", "\0"s, "}"});
+  if (rng() % 10 == 0) line.resize(rng() % (line.size() + 1));
+  if (rng() % 10 == 0) line.insert(rng() % (line.size() + 1), 1, "\"\\{},:0 \t"[rng() % 10]);
+  return line;
+}
+
+// Over whole runs of lines, as the scan hands them out, the run reader answers for every line what
+// ClassifyQueueLine answers: its masks start anywhere in a run, lines cross where they end, and a
+// run's last line may lack its newline.
+TEST(QueueLineDifferential, RunsReadAsLineByLine) {
+  std::mt19937_64 rng(5);
+  size_t fast = 0, lines = 0;
+  for (int round = 0; round < 400 && !::testing::Test::HasFailure(); ++round) {
+    std::string text;
+    for (size_t n = rng() % 200; n > 0; --n) text += CompactLine(rng, "/volume1/photo/2019") + "\n";
+    if (rng() % 2) text += CompactLine(rng, "/v");
+    // In a buffer of exactly its size, so that the sanitizers see any read past the run.
+    const std::vector<char> exact(text.begin(), text.end());
+    const char* const end = exact.data() + exact.size();
+    internal::QueueRunClassifier run(exact.data(), end);
+    for (const char* line = exact.data(); line < end; ++lines) {
+      internal::QueueEventView byRun, alone;
+      const char *runEnd = nullptr, *aloneEnd = nullptr;
+      const QueueLineKind kind = run.Classify(line, byRun, runEnd);
+      const std::string what = ::testing::PrintToString(std::string(line, std::find(line, end, '\n')));
+      ASSERT_EQ(kind, internal::ClassifyQueueLine(line, end, alone, aloneEnd)) << what;
+      if (kind == QueueLineKind::kEvent) {
+        ++fast;
+        EXPECT_EQ(runEnd, aloneEnd) << what;
+        EXPECT_EQ(byRun.event, alone.event) << what;
+        EXPECT_EQ(std::string(byRun.path, byRun.pathSize), std::string(alone.path, alone.pathSize)) << what;
+        EXPECT_EQ(byRun.pathOld ? std::string(byRun.pathOld, byRun.pathOldSize) : "<none>",
+                  alone.pathOld ? std::string(alone.pathOld, alone.pathOldSize) : "<none>")
+            << what;
+      }
+      line = std::find(line, end, '\n') + 1;
+    }
+  }
+  // Both outcomes occur often, or the comparison proves little.
+  EXPECT_TRUE(fast > lines / 10 && fast < lines * 9 / 10) << fast << " of " << lines;
 }
 
 // Queues of generated lines answer status, log, and absorb a settings event as a plain scan would.

@@ -1,12 +1,16 @@
 #include "internal/queue_line_view.h"
 
 #include <climits>
+#include <cstddef>
 #include <cstdint>
 #include <cstring>
 #include <initializer_list>
 
 #ifdef __SSE2__
 #include <emmintrin.h>
+#endif
+#if defined(__x86_64__) && defined(__GNUC__)
+#include <immintrin.h>
 #endif
 
 namespace TAVO {
@@ -61,12 +65,57 @@ FIDX_HOT bool Equals(const char* p, const char (&literal)[N]) {
   return ((a ^ b) | (c ^ d)) == 0;
 }
 
+// The value of the n digits at p, 1 <= n <= 8; the 8 bytes at p may be read. The digits
+// are converted at once, without a branch per digit: their count differs from line to line.
+FIDX_HOT uint64_t EightDigits(const char* p, size_t n) {
+  uint64_t v;
+  std::memcpy(&v, p, 8);
+  // The first digit is the lowest byte: shifting the digits to the top leaves zeros,
+  // leading zero digits, below them and drops what follows them.
+  v = (v & 0x0F0F0F0F0F0F0F0FULL) << (8 * (8 - n));
+  v = (v * 10 + (v >> 8)) & 0x00FF00FF00FF00FFULL;
+  v = (v * 100 + (v >> 16)) & 0x0000FFFF0000FFFFULL;
+  return (v * 10000 + (v >> 32)) & 0xFFFFFFFFULL;
+}
+
+// How many of the 16 bytes at p are digits before the first that is not; 16 when all are.
+FIDX_HOT size_t Digits16(const char* p) {
+#ifdef __SSE2__
+  const __m128i bytes = _mm_loadu_si128(reinterpret_cast<const __m128i*>(p));
+  const unsigned other = static_cast<unsigned>(_mm_movemask_epi8(
+      _mm_or_si128(_mm_cmplt_epi8(bytes, _mm_set1_epi8('0')), _mm_cmpgt_epi8(bytes, _mm_set1_epi8('9')))));
+  return static_cast<size_t>(__builtin_ctz(other | 0x10000u));
+#else
+  size_t n = 0;
+  while (n < 16 && IsDigit(p[n])) ++n;
+  return n;
+#endif
+}
+
 bool IsHighSurrogate(unsigned code) { return code >= 0xD800 && code <= 0xDBFF; }
 
 // The first quote, backslash or newline in [p, end), or end; the bytes from lineBegin on
 // may be read. Inside a string the quote and the backslash are the only bytes with a
 // meaning (the JSON library keeps raw control characters and any other byte as they
 // are), and a newline ends the line before the string.
+#ifdef __SSE2__
+// Where the 64 bytes at p hold a quote, a backslash or a newline, one bit a byte.
+FIDX_HOT uint64_t StopMask64(const char* p) {
+  const __m128i quote = _mm_set1_epi8('"');
+  const __m128i backslash = _mm_set1_epi8('\\');
+  const __m128i newline = _mm_set1_epi8('\n');
+  uint64_t mask = 0;
+  for (int i = 0; i < 4; ++i) {
+    const __m128i bytes = _mm_loadu_si128(reinterpret_cast<const __m128i*>(p + 16 * i));
+    const __m128i hits =
+        _mm_or_si128(_mm_or_si128(_mm_cmpeq_epi8(bytes, quote), _mm_cmpeq_epi8(bytes, backslash)),
+                     _mm_cmpeq_epi8(bytes, newline));
+    mask |= uint64_t(static_cast<unsigned>(_mm_movemask_epi8(hits))) << (16 * i);
+  }
+  return mask;
+}
+#endif
+
 FIDX_HOT const char* FindStringStop(const char* p, const char* end, const char* lineBegin) {
 #ifdef __SSE2__
   const __m128i quote = _mm_set1_epi8('"');
@@ -78,6 +127,13 @@ FIDX_HOT const char* FindStringStop(const char* p, const char* end, const char* 
         _mm_or_si128(_mm_or_si128(_mm_cmpeq_epi8(bytes, quote), _mm_cmpeq_epi8(bytes, backslash)),
                      _mm_cmpeq_epi8(bytes, newline))));
   };
+  // 64 bytes a step: most names and paths end within one or two steps, so the step
+  // count, and with it the branch that ends the search, is mostly the same.
+  while (end - p >= 64) {
+    const uint64_t mask = StopMask64(p);
+    if (mask != 0) return p + __builtin_ctzll(mask);
+    p += 64;
+  }
   while (end - p >= 16) {
     const unsigned mask = stops(p);
     if (mask != 0) return p + __builtin_ctz(mask);
@@ -94,6 +150,21 @@ FIDX_HOT const char* FindStringStop(const char* p, const char* end, const char* 
 #endif
   while (p < end && *p != '"' && *p != '\\' && *p != '\n') ++p;
   return p;
+}
+
+// The same for a string that is likely long, a path: its first 128 bytes are searched
+// before the one branch on the result, so that a path's length does not decide it.
+FIDX_HOT const char* FindPathStop(const char* p, const char* end, const char* lineBegin) {
+#ifdef __SSE2__
+  if (end - p >= 128) {
+    const uint64_t low = StopMask64(p);
+    const uint64_t high = StopMask64(p + 64);
+    const int at = low != 0 ? __builtin_ctzll(low) : 64 + __builtin_ctzll(high | (uint64_t(1) << 63));
+    if ((low | high) != 0) return p + at;
+    p += 128;
+  }
+#endif
+  return FindStringStop(p, end, lineBegin);
 }
 
 void AppendUtf8(std::string& out, unsigned code) {
@@ -174,6 +245,12 @@ class Reader {
   // The line starts at begin and ends at the first newline before limit, or at limit.
   Reader(const char* begin, const char* limit) : begin_(begin), end_(limit) {}
 
+  // At the opening quote of a string member that is read: the position after its closing
+  // quote, or null; value and size as Member gives them.
+  const char* ReadMember(const char* p, const char*& value, size_t& size, std::string& storage) const {
+    return Member(p, value, size, storage);
+  }
+
   QueueLineKind Line(QueueEventView& out, const char*& lineEnd) const {
     if (Canonical(out, lineEnd)) return QueueLineKind::kEvent;
     // What the attempt above left is forgotten: the general reading starts afresh.
@@ -195,10 +272,9 @@ class Reader {
 
  private:
   // The line exactly as the daemon and the library write it: "event" with a plain
-  // integer, "path" as a string without escapes, then at most one "path_old" string
-  // without escapes or one "data" value, compact, and nothing after the object. Such a
-  // line reads the same here as in Root, with fewer steps; false for any other line,
-  // which Root then reads.
+  // integer, "path" as a string, then at most one "path_old" string or one "data" value,
+  // compact, and nothing after the object. Such a line reads the same here as in Root,
+  // with fewer steps; false for any other line, which Root then reads.
   FIDX_HOT bool Canonical(QueueEventView& out, const char*& lineEnd) const {
     static const char kEvent[] = "{\"event\":";
     static const char kPath[] = ",\"path\":\"";
@@ -207,34 +283,77 @@ class Reader {
     const char* p = begin_;
     if (end_ - p < 24 || !Equals(p, kEvent)) return false;
     uint64_t value;
-    p = Digits(p + sizeof(kEvent) - 1, &value);
-    if (p == nullptr || value > UINT_MAX || end_ - p < 10 || !Equals(p, kPath)) return false;
-    const char* begin;
-    const char* end;
-    bool escaped;
-    p = String(p + sizeof(kPath) - 2, begin, end, escaped);
-    if (p == nullptr || escaped) return false;
-    out.path = begin;
-    out.pathSize = static_cast<size_t>(end - begin);
+    p = EventDigits(p + sizeof(kEvent) - 1, value);
+    if (p == nullptr || end_ - p < 10 || !Equals(p, kPath)) return false;
+    p = Member(p + sizeof(kPath) - 2, out.path, out.pathSize, out.pathStorage);
+    if (p == nullptr) return false;
     out.pathOld = nullptr;
     out.pathOldSize = 0;
     if (At(p, ',')) {
       if (end_ - p > 13 && Equals(p, kPathOld)) {
-        p = String(p + sizeof(kPathOld) - 2, begin, end, escaped);
-        if (p == nullptr || escaped) return false;
-        out.pathOld = begin;
-        out.pathOldSize = static_cast<size_t>(end - begin);
+        p = Member(p + sizeof(kPathOld) - 2, out.pathOld, out.pathOldSize, out.pathOldStorage);
       } else if (end_ - p > 8 && Equals(p, kData)) {
-        p = Value(p + sizeof(kData) - 1, 1);
-        if (p == nullptr) return false;
+        p = p + sizeof(kData) - 1;
+        p = At(p, '{') ? CompactObject(p) : Value(p, 1);
       } else {
         return false;
       }
+      if (p == nullptr) return false;
     }
     if (!At(p, '}') || !AtEnd(p + 1) || static_cast<size_t>(p + 1 - begin_) >= kMaxLine) return false;
     out.event = static_cast<unsigned>(value);
     lineEnd = p + 1;
     return true;
+  }
+
+  // The value of an "event" written as a plain integer that fits an unsigned int; null
+  // for anything else. The digits are converted eight at a time, without a branch per
+  // digit: their count differs from line to line.
+  FIDX_HOT const char* EventDigits(const char* p, uint64_t& value) const {
+    const size_t n = DigitRun(p);
+    // At most 10 digits fit; and the conversion reads 8 bytes from p, 16 must follow.
+    if (n == 0 || n > 10 || (n > 1 && *p == '0') || end_ - p < 16) return nullptr;
+    if (n <= 8) {
+      value = EightDigits(p, n);
+    } else {
+      value = EightDigits(p, n - 8) * 100000000u + EightDigits(p + n - 8, 8);
+      if (value > UINT_MAX) return nullptr;
+    }
+    p += n;
+    if (*p == '.' || *p == 'e' || *p == 'E') return nullptr;
+    return p;
+  }
+
+  // At the "{" of a compact object inside the line's object (at depth 1), as Container
+  // reads it: the common members (plain numbers and strings) without a call each.
+  // Blanks, or a member of another kind, go to the general reading of that value.
+  FIDX_HOT const char* CompactObject(const char* p) const {
+    ++p;
+    if (At(p, '}')) return p + 1;
+    for (;;) {
+      if (!At(p, '"')) return Stop(p);
+      const char* begin;
+      const char* end;
+      bool escaped;
+      p = String(p, begin, end, escaped);
+      if (p == nullptr) return nullptr;
+      if (!At(p, ':')) return nullptr;
+      ++p;
+      if (AtEnd(p)) return Stop(p);
+      if (IsDigit(*p)) {
+        p = Digits(p, nullptr);
+      } else if (*p == '"') {
+        p = String(p, begin, end, escaped);
+      } else {
+        p = Value(p, 2);
+      }
+      if (p == nullptr) return nullptr;
+      if (At(p, ',')) {
+        ++p;
+        continue;
+      }
+      return At(p, '}') ? p + 1 : nullptr;
+    }
   }
 
   // The whole value; event tells whether it is an object with an "event" convertible to
@@ -347,12 +466,14 @@ class Reader {
   }
 
   // At the opening quote. [begin, end) is the text between the quotes; escaped tells
-  // whether it holds escapes, so that it is not the value itself.
-  FIDX_HOT const char* String(const char* p, const char*& begin, const char*& end, bool& escaped) const {
+  // whether it holds escapes, so that it is not the value itself. A path is searched
+  // for its end in longer steps.
+  FIDX_HOT const char* String(const char* p, const char*& begin, const char*& end, bool& escaped,
+                              bool path = false) const {
     begin = ++p;
     escaped = false;
+    p = path ? FindPathStop(p, end_, begin_) : FindStringStop(p, end_, begin_);
     for (;;) {
-      p = FindStringStop(p, end_, begin_);
       if (AtEnd(p)) return Stop(p);
       if (*p == '"') {
         end = p;
@@ -361,6 +482,7 @@ class Reader {
       escaped = true;
       p = Escape(p);
       if (p == nullptr) return nullptr;
+      p = FindStringStop(p, end_, begin_);
     }
   }
 
@@ -369,7 +491,7 @@ class Reader {
     const char* begin;
     const char* end;
     bool escaped;
-    p = String(p, begin, end, escaped);
+    p = String(p, begin, end, escaped, true);
     if (p == nullptr) return nullptr;
     if (escaped) {
       Decode(begin, end, storage);
@@ -522,6 +644,183 @@ class Reader {
 #undef FIDX_HOT
 
 }  // namespace
+
+namespace {
+
+// Where the 64 bytes at p hold a quote, a backslash or a newline; words of them from p on.
+void StopMasks(const char* p, size_t words, uint64_t* out) {
+  for (size_t w = 0; w < words; ++w, p += 64) {
+#ifdef __SSE2__
+    out[w] = StopMask64(p);
+#else
+    uint64_t mask = 0;
+    for (int i = 0; i < 64; ++i) {
+      if (p[i] == '"' || p[i] == '\\' || p[i] == '\n') mask |= uint64_t(1) << i;
+    }
+    out[w] = mask;
+#endif
+  }
+}
+
+#if defined(__x86_64__) && defined(__GNUC__)
+#define FIDX_HAVE_AVX2_MASKS 1
+// The same, 32 bytes a step, on processors that have AVX2 (chosen when the masks are
+// computed; the library is built for any x86-64).
+__attribute__((target("avx2"))) void StopMasksAvx2(const char* p, size_t words, uint64_t* out) {
+  const __m256i quote = _mm256_set1_epi8('"');
+  const __m256i backslash = _mm256_set1_epi8('\\');
+  const __m256i newline = _mm256_set1_epi8('\n');
+  for (size_t w = 0; w < words; ++w, p += 64) {
+    uint64_t mask = 0;
+    for (int half = 0; half < 2; ++half) {
+      const __m256i bytes = _mm256_loadu_si256(reinterpret_cast<const __m256i*>(p + 32 * half));
+      const __m256i hits = _mm256_or_si256(
+          _mm256_or_si256(_mm256_cmpeq_epi8(bytes, quote), _mm256_cmpeq_epi8(bytes, backslash)),
+          _mm256_cmpeq_epi8(bytes, newline));
+      mask |= uint64_t(static_cast<uint32_t>(_mm256_movemask_epi8(hits))) << (32 * half);
+    }
+    out[w] = mask;
+  }
+}
+#endif
+
+void ComputeStopMasks(const char* p, size_t words, uint64_t* out) {
+#ifdef FIDX_HAVE_AVX2_MASKS
+  static const bool avx2 = __builtin_cpu_supports("avx2");
+  if (avx2) return StopMasksAvx2(p, words, out);
+#endif
+  StopMasks(p, words, out);
+}
+
+// The longest line read from the masks, and what every step below may read after its
+// position: no read reaches kSpan bytes past the line's start.
+const size_t kSpan = 512;
+const size_t kReach = 24;
+
+}  // namespace
+
+void QueueRunClassifier::Fill(const char* at) {
+  size_t words = static_cast<size_t>(end_ - at) / 64;
+  if (words > kWords) words = kWords;
+  ComputeStopMasks(at, words, masks_);
+  window_ = at;
+  windowEnd_ = at + words * 64;
+}
+
+bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const char*& lineEnd) {
+  static const char kEvent[] = "{\"event\":";
+  static const char kPath[] = ",\"path\":\"";
+  static const char kPathOld[] = ",\"path_old\":\"";
+  static const char kData[] = ",\"data\":";
+  // The masks must cover kSpan bytes from the line on (the line may lie past them).
+  const ptrdiff_t span = static_cast<ptrdiff_t>(kSpan);
+  if (line < window_ || windowEnd_ - line < span) {
+    Fill(line);
+    if (windowEnd_ - line < span) return false;
+  }
+  // Each step reads at most kReach bytes from a position before limit.
+  const char* const limit = line + kSpan - kReach;
+  // The first quote, backslash or newline in [p, limit); stringEnd takes only a quote,
+  // the end of a string without escapes.
+  auto firstStop = [&](const char* p) -> const char* {
+    const size_t at = static_cast<size_t>(p - window_);
+    size_t word = at / 64;
+    uint64_t mask = masks_[word] & (~uint64_t(0) << (at % 64));
+    const size_t lastWord = static_cast<size_t>(limit - window_ - 1) / 64;
+    while (mask == 0) {
+      if (++word > lastWord) return nullptr;
+      mask = masks_[word];
+    }
+    const char* stop = window_ + word * 64 + __builtin_ctzll(mask);
+    return stop < limit ? stop : nullptr;
+  };
+  auto stringEnd = [&](const char* p) -> const char* {
+    const char* stop = firstStop(p);
+    return stop != nullptr && *stop == '"' ? stop : nullptr;
+  };
+  // A number as the general reading takes it: no leading zero, no fraction or exponent,
+  // at most 15 digits here.
+  auto number = [](const char* p) -> const char* {
+    if (*p == '-') ++p;
+    const size_t n = Digits16(p);
+    if (n == 0 || n > 15 || (n > 1 && *p == '0')) return nullptr;
+    p += n;
+    return *p == '.' || *p == 'e' || *p == 'E' ? nullptr : p;
+  };
+  auto literal = [](const char* p) -> const char* {
+    if (std::memcmp(p, "null", 4) == 0 || std::memcmp(p, "true", 4) == 0) return p + 4;
+    return std::memcmp(p, "false", 5) == 0 ? p + 5 : nullptr;
+  };
+
+  const char* p = line;
+  if (!Equals(p, kEvent)) return false;
+  p += sizeof(kEvent) - 1;
+  const size_t digits = Digits16(p);
+  if (digits == 0 || digits > 10 || (digits > 1 && *p == '0')) return false;
+  uint64_t event = digits <= 8 ? EightDigits(p, digits)
+                               : EightDigits(p, digits - 8) * 100000000u + EightDigits(p + digits - 8, 8);
+  if (event > UINT_MAX) return false;
+  p += digits;
+  // A comma here also rules out a fraction or an exponent.
+  if (!Equals(p, kPath)) return false;
+  p += sizeof(kPath) - 1;
+  // A path member from the first byte of its text: the position after its closing quote,
+  // or null. One with escapes is read and decoded as the general reading does.
+  auto member = [&](const char* p, const char*& value, size_t& size, std::string& storage) -> const char* {
+    const char* stop = firstStop(p);
+    if (stop == nullptr || *stop == '\n') return nullptr;
+    if (*stop == '"') {
+      value = p;
+      size = static_cast<size_t>(stop - p);
+      return stop + 1;
+    }
+    stop = Reader(line, end_).ReadMember(p - 1, value, size, storage);
+    return stop != nullptr && stop < limit ? stop : nullptr;
+  };
+  out.pathOld = nullptr;
+  out.pathOldSize = 0;
+  p = member(p, out.path, out.pathSize, out.pathStorage);
+  if (p == nullptr) return false;
+  if (*p == ',') {
+    if (Equals(p, kPathOld)) {
+      p = member(p + sizeof(kPathOld) - 1, out.pathOld, out.pathOldSize, out.pathOldStorage);
+      if (p == nullptr) return false;
+    } else if (Equals(p, kData)) {
+      p += sizeof(kData) - 1;
+      if (*p != '{') {
+        p = literal(p);
+      } else if (*++p == '}') {
+        ++p;
+      } else {
+        // A flat object of plain members; anything nested or escaped is left to the
+        // general reading.
+        const char* stop;
+        for (;;) {
+          if (*p != '"' || (stop = stringEnd(p + 1)) == nullptr || stop[1] != ':') return false;
+          p = stop + 2;
+          if (*p == '"') {
+            stop = stringEnd(p + 1);
+            p = stop == nullptr ? nullptr : stop + 1;
+          } else {
+            p = *p == '-' || IsDigit(*p) ? number(p) : literal(p);
+          }
+          if (p == nullptr || p >= limit) return false;
+          if (*p != ',') break;
+          ++p;
+        }
+        if (*p != '}') return false;
+        ++p;
+      }
+      if (p == nullptr || p >= limit) return false;
+    } else {
+      return false;
+    }
+  }
+  if (*p != '}' || p[1] != '\n') return false;
+  out.event = static_cast<unsigned>(event);
+  lineEnd = p + 1;
+  return true;
+}
 
 QueueLineKind ClassifyQueueLine(const char* data, const char* limit, QueueEventView& out,
                                 const char*& lineEnd) {

@@ -6,6 +6,7 @@
 #define FILEINDEX_INTERNAL_QUEUE_LINE_VIEW_H
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 
 namespace TAVO {
@@ -49,6 +50,38 @@ enum class QueueLineKind {
 // lineEnd is set to the line's end (its "\n" or limit) and out holds its values.
 QueueLineKind ClassifyQueueLine(const char* data, const char* limit, QueueEventView& out,
                                 const char*& lineEnd);
+
+// ClassifyQueueLine for each line of a run of whole lines, as QueueLineReader::NextLines
+// hands them out, asked front to back. The line as the daemon writes it is read from bit
+// masks of the run's quotes, backslashes and newlines, computed a few kilobytes at a time
+// over the bytes at once; any other line goes to ClassifyQueueLine.
+class QueueRunClassifier {
+ public:
+  // The run is [data, end); nothing outside it is read.
+  QueueRunClassifier(const char* data, const char* end) : end_(end), window_(data), windowEnd_(data) {}
+
+  // What ClassifyQueueLine(line, end, out, lineEnd) answers, for line at the start of a
+  // line of the run; asked front to back, the masks are computed once.
+  QueueLineKind Classify(const char* line, QueueEventView& out, const char*& lineEnd) {
+    if (Common(line, out, lineEnd)) return QueueLineKind::kEvent;
+    return ClassifyQueueLine(line, end_, out, lineEnd);
+  }
+
+ private:
+  // The masks cover this many 64-byte words from window_.
+  static const size_t kWords = 128;
+
+  // True when the line is in the daemon's own compact form (escapes only in its paths),
+  // out then read; false leaves the line to ClassifyQueueLine.
+  bool Common(const char* line, QueueEventView& out, const char*& lineEnd);
+  // Masks for the bytes from at on, as many words as the run has left.
+  void Fill(const char* at);
+
+  const char* const end_;
+  const char* window_;
+  const char* windowEnd_;
+  uint64_t masks_[kWords];
+};
 
 }  // namespace internal
 }  // namespace FILEINDEX
