@@ -11,13 +11,14 @@
 #include <set>
 #include <string>
 
+#include "extraction.h"
 #include "share_indexer.h"
 
 namespace fileindexd {
 
 class IndexingService {
  public:
-  explicit IndexingService(fileindex_daemon::EventLoop& loop) : m_loop(loop) {}
+  explicit IndexingService(fileindex_daemon::EventLoop& loop);
   ~IndexingService();
 
   bool Start(std::string& error);
@@ -60,6 +61,8 @@ class IndexingService {
   std::uint64_t m_reloadTimer = 0;
   std::uint64_t m_pollTimer = 0;
   std::uint64_t m_pauseTimer = 0;
+  // Last, so that it goes first: it writes its results into the shares' indexes.
+  Extraction m_extraction;
 };
 
 }  // namespace fileindexd
