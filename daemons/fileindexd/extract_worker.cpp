@@ -57,8 +57,10 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "fileindex-extract: idle I/O priority refused: %s\n", std::strerror(errno));
   struct rlimit noCore = {0, 0};
   ::setrlimit(RLIMIT_CORE, &noCore);
-#if !defined(__SANITIZE_ADDRESS__)
-  // (The address sanitizer reserves terabytes of address space: no limit fits beside it.)
+#if defined(__SANITIZE_ADDRESS__)
+  // The address sanitizer reserves terabytes of address space: no limit fits beside it.
+  (void)memoryMiB;
+#else
   if (memoryMiB > 0) {
     struct rlimit memory;
     memory.rlim_cur = memory.rlim_max = static_cast<rlim_t>(memoryMiB) << 20;

@@ -406,15 +406,25 @@ void ExtractOfficeDocument(int fd, Content& content, std::string& text, const Ex
   XmlText state;
   state.out = &text;
   state.max = limits.maxText;
-  bool found = ReadXmlMember(archive.get(), "content.xml", state, limits);               // OpenDocument
-  found = ReadXmlMember(archive.get(), "word/document.xml", state, limits) || found;     // Word
-  found = ReadXmlMember(archive.get(), "xl/sharedStrings.xml", state, limits) || found;  // Excel
+  // libmagic names a zip by its first members; the members that hold the text say more.
+  const char* type = nullptr;
+  bool found = ReadXmlMember(archive.get(), "content.xml", state, limits);  // OpenDocument
+  if (ReadXmlMember(archive.get(), "word/document.xml", state, limits)) {
+    found = true;
+    type = "application/vnd.openxmlformats-officedocument.wordprocessingml.document";
+  }
+  if (ReadXmlMember(archive.get(), "xl/sharedStrings.xml", state, limits)) {
+    found = true;
+    type = "application/vnd.openxmlformats-officedocument.spreadsheetml.sheet";
+  }
   for (int slide = 1; slide <= 1000 && text.size() < limits.maxText; ++slide) {
     if (!ReadXmlMember(archive.get(), "ppt/slides/slide" + std::to_string(slide) + ".xml", state, limits))
       break;
     found = true;
+    type = "application/vnd.openxmlformats-officedocument.presentationml.presentation";
   }
   if (!found) throw ExtractError("a zip archive without a document's text");
+  if (content.mime == "application/zip" && type != nullptr) content.mime = type;
   content.textTruncated = text.size() >= limits.maxText;
   std::string discard;
   XmlText meta;
