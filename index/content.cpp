@@ -111,16 +111,18 @@ bool IndexWriter::UpgradeLayout() {
   return false;
 }
 
-bool IndexWriter::PendingContent(std::int64_t afterId, std::size_t limit,
-                                 std::vector<ContentCandidate>& out) {
+bool IndexWriter::PendingContent(std::int64_t afterId, std::size_t limit, std::vector<ContentCandidate>& out,
+                                 std::int64_t& scannedTo, bool& atEnd) {
+  const std::int64_t kWindow = 4096;
   Statement* statement = Prepare(
       "SELECT e.id, e.parent, e.name, e.size, e.mtime, e.kind, e.folder FROM entries e"
       " LEFT JOIN contents c ON c.id = e.id"
-      " WHERE e.id > ? AND e.is_dir = 0 AND e.kind != 0"
+      " WHERE e.id > ?1 AND e.id <= ?1 + ?3 AND e.is_dir = 0 AND e.kind != 0"
       "   AND (c.id IS NULL OR c.mtime != e.mtime OR c.size != e.size)"
-      " ORDER BY e.id LIMIT ?");
+      " ORDER BY e.id LIMIT ?2");
   if (statement == nullptr) return false;
-  statement->Bind(afterId).Bind(static_cast<std::int64_t>(limit));
+  const std::size_t before = out.size();
+  statement->Bind(afterId).Bind(static_cast<std::int64_t>(limit)).Bind(kWindow);
   int rc;
   while ((rc = statement->Step()) == SQLITE_ROW) {
     ContentCandidate candidate;
@@ -133,7 +135,12 @@ bool IndexWriter::PendingContent(std::int64_t afterId, std::size_t limit,
     candidate.entry.folder = statement->Text(6);
     out.push_back(std::move(candidate));
   }
-  return rc == SQLITE_DONE || Fail("pending content");
+  if (rc != SQLITE_DONE) return Fail("pending content");
+  scannedTo = out.size() - before == limit ? out.back().id : afterId + kWindow;
+  Statement* last = Prepare("SELECT coalesce(max(id), 0) FROM entries");
+  if (last == nullptr || last->Step() != SQLITE_ROW) return Fail("pending content");
+  atEnd = scannedTo >= last->Int(0);
+  return true;
 }
 
 bool IndexWriter::DropContent(std::int64_t id) {

@@ -146,8 +146,11 @@ class IndexWriter : public Database {
   void Checkpoint();
 
   // What is inside the files (content.h; defined in content.cpp).
-  // Files after afterId (by id) whose content is to be extracted, at most limit.
-  bool PendingContent(std::int64_t afterId, std::size_t limit, std::vector<ContentCandidate>& out);
+  // Files after afterId (by id) whose content is to be extracted, at most limit, among the
+  // next few thousand ids only (so that one call never scans a whole large index).
+  // scannedTo is the id to go on after; atEnd says no id above it exists.
+  bool PendingContent(std::int64_t afterId, std::size_t limit, std::vector<ContentCandidate>& out,
+                      std::int64_t& scannedTo, bool& atEnd);
   // Stores a file's content when its entry is still the version extracted (stored false
   // otherwise); text beyond the caps is dropped and marked truncated.
   bool PutContent(const ContentCandidate& candidate, const Content& content, const std::string& text,

@@ -132,7 +132,27 @@ TEST_F(IndexStoreTest, ContentFollowsItsEntryAndLayoutsAreMigratedOrRebuilt) {
   Put("docs", "a.txt", 5);
   Put("docs", "b.txt", 5);
   std::vector<ContentCandidate> pending;
-  ASSERT_TRUE(writer_->PendingContent(0, 10, pending));
+  std::int64_t next = 0;
+  bool atEnd = false;
+  ASSERT_TRUE(writer_->PendingContent(0, 10, pending, next, atEnd));
+  EXPECT_TRUE(atEnd);
+  {
+    // One look covers a window of ids: a long run without work takes a few looks.
+    std::vector<ContentCandidate> none;
+    ASSERT_TRUE(writer_->Begin());
+    for (int i = 0; i < 5000; ++i) Put("other", std::to_string(i) + ".bin");
+    Put("other", "last.txt");
+    ASSERT_TRUE(writer_->Commit());
+    std::int64_t after = pending.back().id;
+    ASSERT_TRUE(writer_->PendingContent(after, 10, none, after, atEnd));
+    EXPECT_TRUE(none.empty());
+    EXPECT_FALSE(atEnd);
+    ASSERT_TRUE(writer_->PendingContent(after, 10, none, after, atEnd));
+    ASSERT_EQ(none.size(), 1u);
+    EXPECT_EQ(none[0].entry.name, "last.txt");
+    EXPECT_TRUE(atEnd);
+    ASSERT_TRUE(writer_->RemoveBelow("other"));
+  }
   ASSERT_EQ(pending.size(), 2u);
   Content content;
   content.kind = Kind::kDocument;
@@ -154,7 +174,7 @@ TEST_F(IndexStoreTest, ContentFollowsItsEntryAndLayoutsAreMigratedOrRebuilt) {
   EXPECT_EQ(content.textBytes, static_cast<std::int64_t>(kMaxTextPerFile));
   EXPECT_TRUE(content.textTruncated);
   pending.clear();
-  ASSERT_TRUE(writer_->PendingContent(0, 10, pending));
+  ASSERT_TRUE(writer_->PendingContent(0, 10, pending, next, atEnd));
   ASSERT_EQ(pending.size(), 1u);
   EXPECT_EQ(pending[0].entry.name, "b.txt");
   Put("docs", "a.txt", 6);  // changed: its content is due again, and not shown meanwhile

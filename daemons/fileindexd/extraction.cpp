@@ -29,6 +29,8 @@ namespace {
 
 const char kWorkerName[] = "fileindex-extract";
 const std::size_t kBatch = 64;
+// Windows of ids (a few thousand each) looked through per share before the loop gets a turn.
+const int kWindowsPerLook = 8;
 // Results wait at most this long, or until there are this many or this much text, and are
 // then written in one transaction.
 const milliseconds kFlushDelay(200);
@@ -54,7 +56,7 @@ Extraction::Extraction(fileindex_daemon::EventLoop& loop, Shares shares)
 
 Extraction::~Extraction() {
   Flush();
-  for (std::uint64_t timer : {m_limitTimer, m_retryTimer, m_flushTimer, m_reapTimer})
+  for (std::uint64_t timer : {m_limitTimer, m_retryTimer, m_flushTimer, m_reapTimer, m_pumpTimer})
     if (timer != 0) m_loop.Cancel(timer);
   if (m_fd >= 0) {
     m_loop.Unwatch(m_fd);
@@ -159,14 +161,27 @@ bool Extraction::NextCandidate(std::string& shareName, ContentCandidate& candida
     if (it == shares.end()) it = shares.begin();
     ShareIndexer& indexer = *it->second;
     ShareCursor& cursor = m_cursors[it->first];
+    int windows = 0;
     while (!cursor.exhausted) {
       if (cursor.next == cursor.batch.size()) {
+        if (++windows > kWindowsPerLook) {
+          // A long stretch of files already done: go on from here after the loop's next turn.
+          if (m_pumpTimer == 0) {
+            m_pumpTimer = m_loop.After(milliseconds(0), [this]() {
+              m_pumpTimer = 0;
+              Pump();
+            });
+          }
+          break;
+        }
         cursor.batch.clear();
         cursor.next = 0;
-        if (!indexer.Store().PendingContent(cursor.afterId, kBatch, cursor.batch)) {
+        bool atEnd = false;
+        if (!indexer.Store().PendingContent(cursor.afterId, kBatch, cursor.batch, cursor.afterId, atEnd)) {
           Log(LOG_ERR, "share %s: %s", it->first.c_str(), indexer.Store().LastError().c_str());
           break;
         }
+        if (cursor.batch.empty() && !atEnd) continue;
         if (cursor.batch.empty() && cursor.fromStart) {
           cursor.fromStart = false;
           cursor.afterId = 0;
@@ -177,7 +192,6 @@ bool Extraction::NextCandidate(std::string& shareName, ContentCandidate& candida
           cursor.writtenAtEnd = indexer.entriesWritten();
           break;
         }
-        cursor.afterId = cursor.batch.back().id;
       }
       ContentCandidate& next = cursor.batch[cursor.next++];
       if (!indexer.AllowsKind(next.entry.folder, next.entry.kind)) continue;  // switched off meanwhile
@@ -192,6 +206,7 @@ bool Extraction::NextCandidate(std::string& shareName, ContentCandidate& candida
 }
 
 void Extraction::Pump() {
+  std::size_t inline_ = 0;
   while (m_started && !m_busy) {
     if (m_pid < 0) {
       if (m_retryTimer != 0) return;  // waiting to start a worker again
@@ -207,6 +222,24 @@ void Extraction::Pump() {
     std::string share, path;
     ContentCandidate candidate;
     if (!NextCandidate(share, candidate, path)) return;
+    if (candidate.entry.size == 0) {
+      // Nothing inside to read: no need to trouble the worker.
+      Result result{share, std::move(candidate), Content(), ""};
+      result.content.mime = "inode/x-empty";
+      result.content.kind = result.candidate.entry.kind;
+      Record(std::move(result));
+      // A few at a time: the loop has sockets and slices to serve.
+      if (++inline_ >= kBatch) {
+        if (m_pumpTimer == 0) {
+          m_pumpTimer = m_loop.After(milliseconds(0), [this]() {
+            m_pumpTimer = 0;
+            Pump();
+          });
+        }
+        return;
+      }
+      continue;
+    }
     const std::string request = EncodeRequest(path, candidate.entry.kind);
     ssize_t n = ::send(m_fd, request.data(), request.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
     m_busy = true;

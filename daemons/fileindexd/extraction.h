@@ -90,6 +90,7 @@ class Extraction {
   std::uint64_t m_limitTimer = 0;
   std::uint64_t m_retryTimer = 0;
   std::uint64_t m_flushTimer = 0;
+  std::uint64_t m_pumpTimer = 0;
   std::vector<pid_t> m_dying;  // killed, not reaped yet
   std::uint64_t m_reapTimer = 0;
   int m_quickDeaths = 0;  // deaths in a row without a file in hand
