@@ -191,6 +191,27 @@ std::string Deflate(const std::string& data) {
   return out;
 }
 
+// A PDF of one page whose packed content unpacks to 200 MB of text operators.
+bool WritePdfBomb(const std::string& path) {
+  std::string chunk;
+  for (int i = 0; i < 1000; ++i) chunk += "(bomb) Tj 1 0 Td ";
+  std::string unpacked = "BT /F1 12 Tf 72 720 Td ";
+  unpacked.reserve(200u << 20);
+  while (unpacked.size() < (200u << 20)) unpacked += chunk;
+  unpacked += " ET";
+  const std::string packed = Deflate(unpacked);
+  std::string pdf = cs::Pdf({"placeholder"});
+  const std::string shown = "BT /F1 12 Tf 72 720 Td (placeholder) Tj ET";
+  const std::string plain =
+      "<< /Length " + std::to_string(shown.size()) + " >>\nstream\n" + shown + "\nendstream";
+  if (pdf.find(plain) == std::string::npos) return false;
+  pdf.replace(pdf.find(plain), plain.size(),
+              "<< /Length " + std::to_string(packed.size()) + " /Filter /FlateDecode >>\nstream\n" + packed +
+                  "\nendstream");
+  cs::Write(path, pdf);  // (the offsets are off now: poppler reconstructs them)
+  return true;
+}
+
 TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
   // truncated.jpg: cut inside its EXIF block.
   ASSERT_TRUE(cs::WritePhoto(top_ + "/whole.jpg", cs::Exif()));
@@ -199,26 +220,7 @@ TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
   std::size_t exif = jpeg.find(std::string("Exif\0\0", 6));
   ASSERT_NE(exif, std::string::npos);
   cs::Write(top_ + "/truncated.jpg", jpeg.substr(0, exif + 60));
-  // bomb.pdf: one page whose packed content unpacks to 200 MB of text operators.
-  std::string operators = "BT /F1 12 Tf 72 720 Td ";
-  std::string chunk;
-  for (int i = 0; i < 1000; ++i) chunk += "(bomb) Tj 1 0 Td ";
-  std::string unpacked = operators;
-  unpacked.reserve(200u << 20);
-  while (unpacked.size() < (200u << 20)) unpacked += chunk;
-  unpacked += " ET";
-  std::string packed = Deflate(unpacked);
-  unpacked.clear();
-  unpacked.shrink_to_fit();
-  std::string pdf = cs::Pdf({"placeholder"});
-  const std::string shown = "BT /F1 12 Tf 72 720 Td (placeholder) Tj ET";
-  const std::string plain =
-      "<< /Length " + std::to_string(shown.size()) + " >>\nstream\n" + shown + "\nendstream";
-  ASSERT_NE(pdf.find(plain), std::string::npos);
-  pdf.replace(pdf.find(plain), plain.size(),
-              "<< /Length " + std::to_string(packed.size()) + " /Filter /FlateDecode >>\nstream\n" + packed +
-                  "\nendstream");
-  cs::Write(top_ + "/bomb.pdf", pdf);  // (the offsets are off now: poppler reconstructs them)
+  ASSERT_TRUE(WritePdfBomb(top_ + "/bomb.pdf"));
   // huge-tag.mp3: a 32 MiB ID3v2 tag before its frames.
   {
     const std::uint32_t tagSize = 32u << 20;
@@ -278,6 +280,42 @@ TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
   }
   // The daemon itself never stopped.
   EXPECT_EQ(RunJson({"status"})["status"], "finished");
+}
+
+// A worker that dies on a file (here by a signal, as a crash in a library would) takes only
+// that file down: it is recorded as failed with the signal, and the next worker goes on.
+TEST_F(ContentTest, AWorkerThatCrashesFailsOnlyItsFile) {
+  ASSERT_TRUE(WritePdfBomb(top_ + "/bomb.pdf"));
+  ASSERT_NO_FATAL_FAILURE(AddFolder("FILEINDEXD_EXTRACT_TIME_LIMIT=60 "));
+  // The worker: the daemon's child, busy once it has used some CPU time on the bomb.
+  pid_t worker = 0;
+  auto cpuTicks = [](pid_t pid) {
+    std::string stat = ReadFile("/proc/" + std::to_string(pid) + "/stat");
+    std::istringstream fields(stat.substr(stat.rfind(')') + 2));
+    std::string field;
+    long ticks = 0;
+    for (int i = 3; i <= 15 && fields >> field; ++i)
+      if (i == 14 || i == 15) ticks += std::atol(field.c_str());
+    return ticks;
+  };
+  ASSERT_TRUE(WaitUntil(
+      [&] {
+        pid_t daemon = DaemonPid("fileindexd");
+        std::istringstream children(
+            ReadFile("/proc/" + std::to_string(daemon) + "/task/" + std::to_string(daemon) + "/children"));
+        long child = 0;
+        worker = children >> child ? static_cast<pid_t>(child) : 0;
+        return worker > 0 && cpuTicks(worker) > 20;
+      },
+      kDeadline))
+      << Log();
+  ASSERT_EQ(::kill(worker, SIGSEGV), 0);
+  ASSERT_TRUE(WaitExtracted({"bomb.pdf"}));
+  Json::Value why = Why("/photo/mixed/bomb.pdf");
+  EXPECT_EQ(why["state"], "failed");
+  EXPECT_NE(why["content"]["reason"].asString().find("killed by signal 11"), std::string::npos) << why;
+  WriteFile(top_ + "/after.txt", "the turnstone\n");
+  EXPECT_TRUE(WaitUntil([&] { return Paths({"--text", "turnstone"}).size() == 1; }, kDeadline)) << Log();
 }
 
 }  // namespace

@@ -195,12 +195,22 @@ bool Extraction::NextCandidate(std::string& shareName, ContentCandidate& candida
       }
       ContentCandidate& next = cursor.batch[cursor.next++];
       if (!indexer.AllowsKind(next.entry.folder, next.entry.kind)) continue;  // switched off meanwhile
+      if (Waiting(it->first, next)) continue;  // done, its result not written yet
       shareName = it->first;
       candidate = std::move(next);
       path = indexer.PathOnDisk(fileindex_store::JoinPath(candidate.entry.parent, candidate.entry.name));
       m_lastShare = shareName;
       return true;
     }
+  }
+  return false;
+}
+
+bool Extraction::Waiting(const std::string& share, const ContentCandidate& candidate) const {
+  for (const Result& result : m_results) {
+    if (result.candidate.id == candidate.id && result.candidate.entry.mtime == candidate.entry.mtime &&
+        result.candidate.entry.size == candidate.entry.size && result.share == share)
+      return true;
   }
   return false;
 }
@@ -309,10 +319,18 @@ void Extraction::WorkerLost(const std::string& why) {
   }
   std::string reason = why;
   if (m_pid > 0) {
-    ::kill(m_pid, SIGKILL);
     int status = 0;
-    // Usually gone by now; otherwise it is reaped a moment later.
-    pid_t done = ::waitpid(m_pid, &status, WNOHANG);
+    pid_t done = 0;
+    if (reason.empty()) {
+      // Its socket closed: it is on its way out (it dumps no core). A moment's wait tells
+      // how it ended, which is the file's reason.
+      for (int i = 0; i < 20 && (done = ::waitpid(m_pid, &status, WNOHANG)) == 0; ++i) ::usleep(5000);
+    }
+    if (done != m_pid) {
+      ::kill(m_pid, SIGKILL);
+      // Usually gone by now; otherwise it is reaped a moment later.
+      done = ::waitpid(m_pid, &status, WNOHANG);
+    }
     if (reason.empty()) {
       reason = done == m_pid ? "the extraction worker " + DescribeStatus(status)
                              : std::string("the extraction worker closed its socket");

@@ -66,6 +66,8 @@ class Extraction {
 
   void Pump();
   bool NextCandidate(std::string& share, fileindex_store::ContentCandidate& candidate, std::string& path);
+  // Whether the file's result waits in m_results to be written.
+  bool Waiting(const std::string& share, const fileindex_store::ContentCandidate& candidate) const;
   bool Spawn();
   void OnReadable();
   // The worker is gone or must go: the file in hand is recorded as failed with reason.
