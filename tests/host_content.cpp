@@ -124,6 +124,15 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   for (const std::string& name : all)
     EXPECT_EQ(Why("/photo/mixed/" + name)["content"]["state"], "extracted") << name << Log();
 
+  // Why other files are not indexed.
+  WriteFile(top_ + "/@eaDir/thumb.txt", "thumbnail\n");
+  Json::Value skipped = Why("/photo/mixed/@eaDir/thumb.txt");
+  EXPECT_EQ(skipped["state"], "skipped") << skipped;
+  EXPECT_EQ(skipped["indexed"], false);
+  EXPECT_EQ(Run({"why", "/photo/mixed/@eaDir/thumb.txt"}).status, 3);
+  EXPECT_EQ(Why("/photo/2019/beach.jpg")["state"], "outside");
+  EXPECT_EQ(Why("/photo/mixed/nothing.txt")["state"], "missing");
+
   auto gulls = Search({"--artist", "gulls"});
   ASSERT_EQ(gulls.size(), 1u) << ReadFile(work_ + "/stdout") << ReadFile(work_ + "/stderr");
   const Json::Value& song = gulls["/photo/mixed/music/song.mp3"];
