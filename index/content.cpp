@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -136,10 +137,13 @@ bool IndexWriter::PendingContent(std::int64_t afterId, std::size_t limit, std::v
     out.push_back(std::move(candidate));
   }
   if (rc != SQLITE_DONE) return Fail("pending content");
-  scannedTo = out.size() - before == limit ? out.back().id : afterId + kWindow;
   Statement* last = Prepare("SELECT coalesce(max(id), 0) FROM entries");
   if (last == nullptr || last->Step() != SQLITE_ROW) return Fail("pending content");
-  atEnd = scannedTo >= last->Int(0);
+  const std::int64_t maxId = last->Int(0);
+  // Never past the last id there is: entries added later get the ids above it.
+  scannedTo =
+      out.size() - before == limit ? out.back().id : std::min(afterId + kWindow, std::max(maxId, afterId));
+  atEnd = scannedTo >= maxId;
   return true;
 }
 
