@@ -31,6 +31,9 @@ class ContentTest : public SandboxTest {
   }
   void CheckLogs() override {
     std::string text = ReadFile(root_ + "/var/log/fileindexd.log");
+    // (In the sanitizer build, the worker's memory limit is the sanitizer's, which says so.)
+    for (std::size_t at; (at = text.find("AddressSanitizer: soft rss limit exhausted")) != std::string::npos;)
+      text.erase(at, text.find('\n', at) - at);
     EXPECT_EQ(text.find("Sanitizer"), std::string::npos) << text;
     EXPECT_EQ(text.find("runtime error"), std::string::npos) << text;
   }
@@ -200,10 +203,11 @@ std::string Deflate(const std::string& data) {
   return out;
 }
 
-// A PDF of one page whose packed content unpacks to 200 MB of text operators.
-bool WritePdfBomb(const std::string& path) {
+// A PDF of one page whose packed content unpacks to 200 MB of text operators. Words kept
+// on the page pile up in the text extractor's memory; words moved off it cost time only.
+bool WritePdfBomb(const std::string& path, bool onPage) {
   std::string chunk;
-  for (int i = 0; i < 1000; ++i) chunk += "(bomb) Tj 1 0 Td ";
+  for (int i = 0; i < 1000; ++i) chunk += onPage ? "(bomb) Tj 0.0001 0 Td " : "(bomb) Tj 1 0 Td ";
   std::string unpacked = "BT /F1 12 Tf 72 720 Td ";
   unpacked.reserve(200u << 20);
   while (unpacked.size() < (200u << 20)) unpacked += chunk;
@@ -229,7 +233,8 @@ TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
   std::size_t exif = jpeg.find(std::string("Exif\0\0", 6));
   ASSERT_NE(exif, std::string::npos);
   cs::Write(top_ + "/truncated.jpg", jpeg.substr(0, exif + 60));
-  ASSERT_TRUE(WritePdfBomb(top_ + "/bomb.pdf"));
+  ASSERT_TRUE(WritePdfBomb(top_ + "/bomb.pdf", true));
+  ASSERT_TRUE(WritePdfBomb(top_ + "/slow.pdf", false));
   // huge-tag.mp3: a 32 MiB ID3v2 tag before its frames.
   {
     const std::uint32_t tagSize = 32u << 20;
@@ -252,14 +257,15 @@ TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
   }
   WriteFile(top_ + "/after.txt", "the sandpiper comes last\n");
 
-  const std::vector<std::string> hostile{"truncated.jpg", "bomb.pdf", "huge-tag.mp3", "bomb.docx"};
+  const std::vector<std::string> hostile{"truncated.jpg", "bomb.pdf", "slow.pdf", "huge-tag.mp3",
+                                         "bomb.docx"};
   auto started = std::chrono::steady_clock::now();
   ASSERT_NO_FATAL_FAILURE(AddFolder("FILEINDEXD_EXTRACT_TIME_LIMIT=3 FILEINDEXD_EXTRACT_MEMORY_LIMIT=256 "));
   std::vector<std::string> names = hostile;
   names.push_back("after.txt");
   ASSERT_TRUE(WaitExtracted(names));
   // One file at a time, each within its limit of 3 s: none took much longer.
-  EXPECT_LT(std::chrono::steady_clock::now() - started, 25s);
+  EXPECT_LT(std::chrono::steady_clock::now() - started, 30s);
 
   std::map<std::string, std::string> reasons;
   for (const std::string& name : hostile) {
@@ -271,12 +277,16 @@ TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
   EXPECT_NE(reasons["huge-tag.mp3"].find("ID3v2 tag of 32 MiB"), std::string::npos)
       << reasons["huge-tag.mp3"];
   EXPECT_NE(reasons["bomb.docx"].find("word/document.xml"), std::string::npos) << reasons["bomb.docx"];
-  // The bomb takes the worker down: by its time limit, or by its memory limit.
+  // The bombs take the worker down: one by its memory limit (poppler aborts when an
+  // allocation fails; the sanitizer build's limit is slower and may lose to the time
+  // limit), the other by its time limit.
   const std::string& bomb = reasons["bomb.pdf"];
-  EXPECT_TRUE(bomb.find("longer than the limit of 3000 ms") != std::string::npos ||
+  EXPECT_TRUE(bomb.find("killed by signal 6") != std::string::npos ||
               bomb.find("out of memory") != std::string::npos ||
-              bomb.find("killed by signal") != std::string::npos)
+              bomb.find("longer than the limit of 3000 ms") != std::string::npos)
       << bomb;
+  EXPECT_NE(reasons["slow.pdf"].find("longer than the limit of 3000 ms"), std::string::npos)
+      << reasons["slow.pdf"];
   // ... and another worker took over: the file after it was extracted.
   EXPECT_EQ(Paths({"--text", "sandpiper"}), std::set<std::string>{"/photo/mixed/after.txt"});
   std::string log = Log();
@@ -284,9 +294,7 @@ TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
   for (std::size_t at = log.find("extraction worker "); at != std::string::npos;
        at = log.find("extraction worker ", at + 1))
     workers += log.compare(log.find(' ', at + 18), 8, " started") == 0;
-  if (bomb.find("out of memory") == std::string::npos) {
-    EXPECT_GE(workers, 2u) << log;
-  }
+  EXPECT_GE(workers, 2u) << log;
   // The daemon itself never stopped.
   EXPECT_EQ(RunJson({"status"})["status"], "finished");
 }
@@ -294,7 +302,7 @@ TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
 // A worker that dies on a file (here by SIGABRT, as a library that aborts would) takes only
 // that file down: it is recorded as failed with the signal, and the next worker goes on.
 TEST_F(ContentTest, AWorkerThatCrashesFailsOnlyItsFile) {
-  ASSERT_TRUE(WritePdfBomb(top_ + "/bomb.pdf"));
+  ASSERT_TRUE(WritePdfBomb(top_ + "/bomb.pdf", false));
   ASSERT_NO_FATAL_FAILURE(AddFolder("FILEINDEXD_EXTRACT_TIME_LIMIT=60 "));
   // The worker: the daemon's child, busy once it has used some CPU time on the bomb.
   pid_t worker = 0;
@@ -324,7 +332,11 @@ TEST_F(ContentTest, AWorkerThatCrashesFailsOnlyItsFile) {
   EXPECT_EQ(why["state"], "failed");
   EXPECT_NE(why["content"]["reason"].asString().find("killed by signal 6"), std::string::npos) << why;
   WriteFile(top_ + "/after.txt", "the turnstone\n");
-  EXPECT_TRUE(WaitUntil([&] { return Paths({"--text", "turnstone"}).size() == 1; }, kDeadline))
+  EXPECT_TRUE(WaitUntil(
+      [&] {
+        return Paths({"--text", "turnstone"}).size() == 1;
+      },
+      kDeadline))
       << Why("/photo/mixed/after.txt") << Log();
 }
 
