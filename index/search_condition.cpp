@@ -160,7 +160,6 @@ bool IsContinuation(unsigned char c) { return (c & 0xC0) == 0x80; }
 // the shapes SQLite plans with indexes ("0 OR x IN (...)" would be a scan of every row).
 Condition Simplified(const Condition& c) {
   using T = Condition::Type;
-  if (c.type == T::kText) return Condition::Of(T::kNone);  // no extracted text is indexed yet
   if (c.type != T::kAnd && c.type != T::kOr && c.type != T::kNot) return c;
   Condition out = Condition::Of(c.type);
   const T absorbing = c.type == T::kAnd ? T::kNone : T::kAll;  // decides the whole
@@ -221,7 +220,9 @@ class SqlBuilder {
         if (!HasWordCharacter(c.text) && !HasNonAscii(c.text)) return c.prefix && c.text.empty() ? "1" : "0";
         return NameMatch(Phrase(c.text) + (c.prefix ? "*" : ""));
       case T::kText:
-        return "0";  // no extracted text is indexed yet (see Simplified)
+        if (!HasWordCharacter(c.text) && !HasNonAscii(c.text)) return "0";
+        return "e.id IN (SELECT rowid FROM texts WHERE texts MATCH " +
+               Text(Phrase(c.text) + (c.prefix ? "*" : "")) + ")";
       case T::kContentType:
         return ContentType(c.text);
       case T::kSize:

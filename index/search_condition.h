@@ -23,7 +23,8 @@ struct Condition {
                    // '\' makes the next character literal; case and accents ignored
     kWords,        // the name holds the words of `text` in order, the last one a prefix
                    // when `prefix`; case and accents ignored
-    kText,         // the file's extracted text holds the words of `text`
+    kText,         // the file's extracted text holds the words of `text` in order, the last
+                   // one a prefix when `prefix`
     kContentType,  // the content type matches `text` ("image/jpeg", "image/*")
     kSize,         // files whose size is within the range
     kModified,     // entries modified within the range (seconds since the epoch)

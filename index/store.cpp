@@ -8,6 +8,8 @@
 #include <cstring>
 #include <unordered_map>
 
+#include "content.h"
+
 namespace fileindex_store {
 
 namespace {
@@ -180,12 +182,19 @@ std::unique_ptr<IndexWriter> IndexWriter::Open(const std::string& dbDir, std::st
     return nullptr;
   }
   sqlite3_busy_timeout(db, kBusyTimeoutMs);
+  if (writer->LayoutVersion() > kLayoutVersion) {
+    // Written by a newer program: what it holds cannot be trusted to mean what this one
+    // thinks, and all of it can be found again on disk.
+    writer.reset();
+    for (const char* suffix : {"", "-wal", "-shm"}) ::unlink((file + suffix).c_str());
+    return Open(dbDir, error);
+  }
   const std::string pragmas = "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA foreign_keys=OFF;";
   if (!RegisterMatchingFunctions(db)) {
     error = file + ": " + sqlite3_errmsg(db);
     return nullptr;
   }
-  if (!writer->Exec(pragmas.c_str()) || !writer->Exec(kSchema)) {
+  if (!writer->Exec(pragmas.c_str()) || !writer->Exec(kSchema) || !writer->UpgradeLayout()) {
     error = file + ": " + writer->LastError();
     return nullptr;
   }
@@ -200,6 +209,7 @@ std::unique_ptr<IndexWriter> IndexWriter::Open(const std::string& dbDir, std::st
 bool IndexWriter::Begin() { return Exec("BEGIN IMMEDIATE"); }
 bool IndexWriter::Commit() { return Exec("COMMIT"); }
 void IndexWriter::Rollback() {
+  m_textBytes = -1;
   if (!sqlite3_get_autocommit(m_db)) Exec("ROLLBACK");
 }
 
@@ -293,12 +303,17 @@ bool IndexWriter::Remove(const std::string& parent, const std::string& name) {
   const bool wasDir = found && statement->Int(1) != 0;
   while (rc == SQLITE_ROW) rc = statement->Step();
   if (rc != SQLITE_DONE) return Fail("remove");
-  if (found && !UnindexName(id, name)) return false;
+  if (found && (!UnindexName(id, name) || !DropContent(id))) return false;
   return !wasDir || RemoveBelow(JoinPath(parent, name));
 }
 
 bool IndexWriter::RemoveBelow(const std::string& dir) {
-  if (dir.empty()) return Exec("DELETE FROM entries; INSERT INTO names(names) VALUES ('delete-all');");
+  if (dir.empty()) {
+    m_textBytes = -1;
+    return Exec(
+        "DELETE FROM entries; INSERT INTO names(names) VALUES ('delete-all'); DELETE FROM contents;"
+        " DELETE FROM texts;");
+  }
   // Everything in dir, and in directories whose path begins with dir + "/": a range of
   // the (parent, name) index, since "0" sorts right after "/". The names leave the
   // full-text index row by row first (read back as they go, so a huge subtree needs no
@@ -309,7 +324,7 @@ bool IndexWriter::RemoveBelow(const std::string& dir) {
   rows->Bind(dir);
   int rc;
   while ((rc = rows->Step()) == SQLITE_ROW) {
-    if (!UnindexName(rows->Int(0), rows->Text(1))) return false;
+    if (!UnindexName(rows->Int(0), rows->Text(1)) || !DropContent(rows->Int(0))) return false;
   }
   if (rc != SQLITE_DONE) return Fail("remove below");
   Statement* statement =
@@ -375,6 +390,12 @@ std::unique_ptr<IndexReader> IndexReader::Open(const std::string& dbDir, std::st
   sqlite3_busy_timeout(db, kBusyTimeoutMs);
   if (!RegisterMatchingFunctions(db)) {
     error = file + ": " + sqlite3_errmsg(db);
+    return nullptr;
+  }
+  Statement layout(db, "PRAGMA user_version");
+  if (!layout.ok() || layout.Step() != SQLITE_ROW || layout.Int(0) > kLayoutVersion) {
+    error = file + ": index layout " + (layout.ok() ? std::to_string(layout.Int(0)) : "unreadable") +
+            " is not this program's (" + std::to_string(kLayoutVersion) + "); fileindexd rebuilds it";
     return nullptr;
   }
   return reader;

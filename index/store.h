@@ -29,6 +29,9 @@ std::string ExtensionOf(const std::string& name);
 // The kind of a file, decided by its extension.
 Kind KindOfExtension(const std::string& extension);
 
+struct Content;
+struct ContentCandidate;
+
 struct Entry {
   std::string parent;  // directory holding the entry, relative to the share ("" at its top)
   std::string name;
@@ -75,6 +78,16 @@ class Statement {
     sqlite3_bind_int64(m_stmt, ++m_index, value);
     return *this;
   }
+  Statement& Bind(double value) {
+    sqlite3_bind_double(m_stmt, ++m_index, value);
+    return *this;
+  }
+  Statement& BindNull() {
+    sqlite3_bind_null(m_stmt, ++m_index);
+    return *this;
+  }
+  bool IsNull(int column) const { return sqlite3_column_type(m_stmt, column) == SQLITE_NULL; }
+  sqlite3_stmt* Raw() const { return m_stmt; }
   // SQLITE_ROW, SQLITE_DONE or an error code.
   int Step() { return sqlite3_step(m_stmt); }
   std::string Text(int column) const {
@@ -134,10 +147,28 @@ class IndexWriter : public Database {
   // Flushes the write-ahead log into the database (at shutdown).
   void Checkpoint();
 
+  // What is inside the files (content.h; defined in content.cpp).
+  // Files after afterId (by id) whose content is to be extracted, at most limit, among the
+  // next few thousand ids only (so that one call never scans a whole large index).
+  // scannedTo is the id to go on after; atEnd says no id above it exists.
+  bool PendingContent(std::int64_t afterId, std::size_t limit, std::vector<ContentCandidate>& out,
+                      std::int64_t& scannedTo, bool& atEnd);
+  // Stores a file's content when its entry is still the version extracted (stored false
+  // otherwise); text beyond the caps is dropped and marked truncated.
+  bool PutContent(const ContentCandidate& candidate, const Content& content, const std::string& text,
+                  bool& stored);
+  bool DropContent(std::int64_t id);
+
  private:
   using Database::Database;
   // Takes an entry's name out of the full-text index (before or after its row goes).
   bool UnindexName(std::int64_t id, const std::string& name);
+  // The layout version of an open index: 0 for none yet or the first layout.
+  int LayoutVersion();
+  // Creates the content tables and marks the layout as current.
+  bool UpgradeLayout();
+
+  std::int64_t m_textBytes = -1;  // text kept in all; -1 until first needed
 };
 
 struct Query {

@@ -17,7 +17,7 @@ SERVICE_ARGS=${SERVICE_ARGS:-}
 
 cmake -S . -B "$BUILD_DIR" -DCMAKE_BUILD_TYPE=Release -DFILEINDEX_BENCH=ON -DFILEINDEX_TESTS=OFF >/dev/null
 targets=(fileindex_bench fileindex_queue_rss)
-[ "$SERVICE" = 0 ] || targets+=(fileindex_bench_service fileindexctl fileindexd tavotifyd)
+[ "$SERVICE" = 0 ] || targets+=(fileindex_bench_service fileindexctl fileindexd fileindex-extract tavotifyd)
 cmake --build "$BUILD_DIR" -j2 --target "${targets[@]}" >/dev/null
 
 echo "load before: $(uptime)"

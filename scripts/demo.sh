@@ -3,8 +3,8 @@
 # dependencies, builds the library, the host platform, fileindexctl and the two daemons
 # (Release, in build-demo), creates a sandbox system root in a temporary directory with a
 # few hundred files, and drives the whole loop through fileindexctl: folders added and
-# crawled, files found, created, renamed, a file type switched off, indexing paused and
-# resumed, a folder removed.
+# crawled, files found, created, renamed, photos, music and documents found by what is inside
+# them, a file type switched off, indexing paused and resumed, a folder removed.
 #
 #   bash scripts/demo.sh            (KEEP_SANDBOX=1 keeps the sandbox afterwards)
 set -euo pipefail
@@ -13,8 +13,10 @@ cd "$(dirname "$0")/.."
 bash scripts/install-deps.sh
 BUILD_DIR=${BUILD_DIR:-build-demo}
 cmake -S . -B "$BUILD_DIR" -DCMAKE_BUILD_TYPE=Release -DFILEINDEX_TESTS=OFF >/dev/null
-cmake --build "$BUILD_DIR" -j"$(nproc)" --target fileindexctl fileindexd tavotifyd fileindex-probe >/dev/null
+cmake --build "$BUILD_DIR" -j"$(nproc)" --target fileindexctl fileindexd fileindex-extract tavotifyd fileindex-probe \
+  fileindex-samples >/dev/null
 CTL="$PWD/$BUILD_DIR/tools/fileindexctl/fileindexctl"
+SAMPLES="$PWD/$BUILD_DIR/tools/samples/fileindex-samples"
 
 SANDBOX=$(mktemp -d /tmp/fileindex-demo.XXXXXX)
 cleanup() {
@@ -116,6 +118,23 @@ else
   ' _ "$SANDBOX" || say "(Samba could not be started; see $SANDBOX/samba/log)"
 fi
 
+step "What is inside the files: photos by camera and date taken, songs by their tags, documents by their words"
+"$SAMPLES" "$SANDBOX"
+say "photos with EXIF, tagged MP3 and FLAC songs, a video, a PDF, a .docx and an .odt, and a photo cut short"
+say "fileindexd hands them to fileindex-extract (nice 19, idle I/O, a time and a memory limit per file)"
+wait_search found /photo/2020/trip/IMG_0412.jpg --camera kestrel
+ctl search --camera kestrel
+ctl search --kind photo --taken-after 2020-08-01
+wait_search found "/music/albums/Low Tide/03.flac" --artist gulls
+ctl search --artist gulls --album tide
+ctl search --title lighthouse
+wait_search found /photo/2020/trip/itinerary.pdf --text puffin
+ctl search --text puffin
+ctl search --text guillemots
+ctl search --text binoculars --json
+ctl why /photo/2020/trip/IMG_0977.jpg
+ctl why /photo/2020/trip/IMG_0413.jpg
+
 step "A new file is found within moments"
 : > "$SANDBOX/volume1/photo/2020/lighthouse.jpg"
 wait_search found /photo/2020/lighthouse.jpg lighthouse
@@ -131,6 +150,7 @@ step "Switch the photo flag of /photo/2019 off: its photos leave the index (its 
 ctl folders set /photo/2019 --no-photo
 wait_search gone /photo/2019/beach_2019-0.jpg beach 2019
 ctl search 2019 --limit 4
+ctl why /photo/2019/beach_2019-0.jpg
 wait_status finished
 ctl status /photo/2019
 

@@ -6,7 +6,9 @@ packages=(cmake make g++ pkg-config libjsoncpp-dev libicu-dev libgtest-dev libgm
           libbenchmark-dev libcli11-dev python3 abigail-tools
           clang-14 libclang-rt-14-dev
           libsqlite3-dev sqlite3 libsystemd-dev util-linux procps
-          libcpp-httplib-dev samba smbclient iproute2 passwd)
+          libcpp-httplib-dev samba smbclient iproute2 passwd
+          libexiv2-dev libtag1-dev libpoppler-cpp-dev libavformat-dev libavcodec-dev libavutil-dev
+          libmagic-dev libzip-dev libexpat1-dev zlib1g-dev)
 missing=()
 for p in "${packages[@]}"; do
   dpkg -s "$p" >/dev/null 2>&1 || missing+=("$p")

@@ -1,6 +1,8 @@
 // The per-share index store: entries kept per directory, subtrees removed on whole path
 // components, and name searches by word prefix, case and accents ignored, newest first.
+#include <content.h>
 #include <gtest/gtest.h>
+#include <sqlite3.h>
 #include <store.h>
 #include <sys/stat.h>
 
@@ -122,6 +124,104 @@ TEST_F(IndexStoreTest, IndexIsPrivateAndReadersNeedOne) {
   std::string error;
   EXPECT_FALSE(IndexReader::Open(dir_ + "/none", error));
   EXPECT_NE(error.find("/none/"), std::string::npos) << error;
+}
+
+// The content of a file belongs to one version of it and goes with its entry; its text is
+// capped; an index of another layout is migrated or rebuilt, and never read as it is.
+TEST_F(IndexStoreTest, ContentFollowsItsEntryAndLayoutsAreMigratedOrRebuilt) {
+  Put("docs", "a.txt", 5);
+  Put("docs", "b.txt", 5);
+  std::vector<ContentCandidate> pending;
+  std::int64_t next = 0;
+  bool atEnd = false;
+  ASSERT_TRUE(writer_->PendingContent(0, 10, pending, next, atEnd));
+  EXPECT_TRUE(atEnd);
+  {
+    // One look covers a window of ids: a long run without work takes a few looks.
+    std::vector<ContentCandidate> none;
+    ASSERT_TRUE(writer_->Begin());
+    for (int i = 0; i < 5000; ++i) Put("other", std::to_string(i) + ".bin");
+    Put("other", "last.txt");
+    ASSERT_TRUE(writer_->Commit());
+    std::int64_t after = pending.back().id;
+    ASSERT_TRUE(writer_->PendingContent(after, 10, none, after, atEnd));
+    EXPECT_TRUE(none.empty());
+    EXPECT_FALSE(atEnd);
+    ASSERT_TRUE(writer_->PendingContent(after, 10, none, after, atEnd));
+    ASSERT_EQ(none.size(), 1u);
+    EXPECT_EQ(none[0].entry.name, "last.txt");
+    EXPECT_TRUE(atEnd);
+    ASSERT_TRUE(writer_->RemoveBelow("other"));
+  }
+  ASSERT_EQ(pending.size(), 2u);
+  Content content;
+  content.kind = Kind::kDocument;
+  content.mime = "text/plain";
+  bool stored = false;
+  ASSERT_TRUE(writer_->PutContent(pending[0], content, std::string(kMaxTextPerFile + 10, 'w'), stored));
+  EXPECT_TRUE(stored);
+  ContentCandidate stale = pending[1];
+  stale.entry.mtime = 4;  // extracted from a version the index no longer has
+  ASSERT_TRUE(writer_->PutContent(stale, content, "old words", stored));
+  EXPECT_FALSE(stored);
+  std::string error;
+  auto reader = ContentReader::Open(dir_ + "/db", error);
+  ASSERT_TRUE(reader) << error;
+  Entry entry;
+  bool found = false, hasContent = false;
+  ASSERT_TRUE(reader->Lookup("docs/a.txt", entry, found, content, hasContent));
+  ASSERT_TRUE(found && hasContent);
+  EXPECT_EQ(content.textBytes, static_cast<std::int64_t>(kMaxTextPerFile));
+  EXPECT_TRUE(content.textTruncated);
+  pending.clear();
+  ASSERT_TRUE(writer_->PendingContent(0, 10, pending, next, atEnd));
+  ASSERT_EQ(pending.size(), 1u);
+  EXPECT_EQ(pending[0].entry.name, "b.txt");
+  Put("docs", "a.txt", 6);  // changed: its content is due again, and not shown meanwhile
+  ASSERT_TRUE(reader->Lookup("docs/a.txt", entry, found, content, hasContent));
+  EXPECT_FALSE(hasContent);
+  auto rows = [this](const char* sql) {
+    sqlite3* db = nullptr;
+    sqlite3_stmt* statement = nullptr;
+    sqlite3_open_v2((dir_ + "/db/index.sqlite3").c_str(), &db, SQLITE_OPEN_READONLY, nullptr);
+    sqlite3_prepare_v2(db, sql, -1, &statement, nullptr);
+    int count = sqlite3_step(statement) == SQLITE_ROW ? sqlite3_column_int(statement, 0) : -1;
+    sqlite3_finalize(statement);
+    sqlite3_close(db);
+    return count;
+  };
+  EXPECT_EQ(rows("SELECT count(*) FROM texts WHERE texts MATCH 'www*'"), 1);
+  ASSERT_TRUE(writer_->RemoveBelow("docs"));
+  EXPECT_EQ(rows("SELECT count(*) FROM contents"), 0);
+  EXPECT_EQ(rows("SELECT count(*) FROM texts WHERE texts MATCH 'www*'"), 0);
+  reader.reset();
+
+  // The first layout (no content tables, user_version 0): readers refuse it, the writer
+  // migrates it and keeps its entries.
+  Put("docs", "c.txt");
+  writer_.reset();
+  auto setLayout = [this](const char* sql) {
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open((dir_ + "/db/index.sqlite3").c_str(), &db), SQLITE_OK);
+    EXPECT_EQ(sqlite3_exec(db, sql, nullptr, nullptr, nullptr), SQLITE_OK) << sqlite3_errmsg(db);
+    sqlite3_close(db);
+  };
+  setLayout("DROP TABLE contents; DROP TABLE texts; PRAGMA user_version=0;");
+  EXPECT_FALSE(ContentReader::Open(dir_ + "/db", error));
+  EXPECT_NE(error.find("migrates"), std::string::npos) << error;
+  writer_ = IndexWriter::Open(dir_ + "/db", error);
+  ASSERT_TRUE(writer_) << error;
+  EXPECT_EQ(All(), std::set<std::string>{"docs/c.txt"});
+  EXPECT_TRUE(ContentReader::Open(dir_ + "/db", error)) << error;
+
+  // A newer layout: nothing reads it; the writer starts it again from nothing.
+  writer_.reset();
+  setLayout("PRAGMA user_version=99;");
+  EXPECT_FALSE(IndexReader::Open(dir_ + "/db", error));
+  EXPECT_FALSE(ContentReader::Open(dir_ + "/db", error));
+  writer_ = IndexWriter::Open(dir_ + "/db", error);
+  ASSERT_TRUE(writer_) << error;
+  EXPECT_TRUE(All().empty());
 }
 
 }  // namespace

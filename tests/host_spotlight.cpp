@@ -1,6 +1,7 @@
 // Samba's Spotlight searches answered from a share's index: each query form Samba writes
 // for Finder selects the right files, hostile queries are refused, and the answers hold
 // only existing files of folders still indexed.
+#include <content.h>
 #include <gtest/gtest.h>
 #include <json/json.h>
 #include <query_string.h>
@@ -44,6 +45,17 @@ class SpotlightTest : public ::testing::Test {
     ASSERT_TRUE(writer_->PutFolder(folder));
     folder.path = "old";
     ASSERT_TRUE(writer_->PutFolder(folder));
+    // What the extraction worker read inside one file.
+    std::vector<ContentCandidate> pending;
+    std::int64_t scannedTo = 0;
+    bool atEnd = false, stored = false;
+    ASSERT_TRUE(writer_->PendingContent(0, 100, pending, scannedTo, atEnd));
+    for (const ContentCandidate& candidate : pending) {
+      if (candidate.entry.name == "beach notes.txt") {
+        ASSERT_TRUE(writer_->PutContent(candidate, Content(), "A puffin colony on the cliffs", stored));
+      }
+    }
+    ASSERT_TRUE(stored);
     ASSERT_TRUE(writer_->Commit());
     search_.SetShares({{"photo", share_, dir_ + "/db", {"2020"}}});
   }
@@ -107,6 +119,9 @@ TEST_F(SpotlightTest, EveryFormSambaWritesSelectsTheRightFiles) {
   EXPECT_EQ(Find("file.filename:café*"), Paths{"2020/Café del Mar.flac"});
   EXPECT_EQ(Find("file.filename:CAFE\\ DEL*"), Paths{"2020/Café del Mar.flac"});  // accents ignored
   EXPECT_EQ(Find("walk*"), Paths{"2020/trips/beach walk.mp4"});                   // any word of the name
+  EXPECT_EQ(Find("puff*"), Paths{"2020/beach notes.txt"});                        // or of the text
+  EXPECT_EQ(Find("content:puffin\\ colony"), Paths{"2020/beach notes.txt"});
+  EXPECT_EQ(Find("content:colony\\ puffin"), Paths{});
   EXPECT_EQ(Find("file.content_type:(image\\/jpeg)"),
             (Paths{"2020/beach one.jpg", "2020/Beach (1) copy.jpg"}));
   EXPECT_EQ(

@@ -40,7 +40,19 @@ bool MakeDirectories(const std::string& path) {
 }
 }  // namespace
 
+IndexingService::IndexingService(fileindex_daemon::EventLoop& loop)
+    : m_loop(loop), m_extraction(loop, [this]() {
+        std::map<std::string, ShareIndexer*> shares;
+        if (m_paused) return shares;
+        for (auto& entry : m_shares) {
+          if (entry.second.stop == Stop::kNone && entry.second.indexer)
+            shares[entry.first] = entry.second.indexer.get();
+        }
+        return shares;
+      }) {}
+
 IndexingService::~IndexingService() {
+  m_extraction.Flush();
   m_shares.clear();  // closes every index cleanly
   if (m_inotify >= 0) {
     m_loop.Unwatch(m_inotify);
@@ -70,6 +82,8 @@ bool IndexingService::Start(std::string& error) {
   ReloadPause();
   ReloadConfig();
   m_loop.After(kTickInterval, [this]() { Tick(); });
+  m_extraction.Start();
+  m_extraction.Wake();
   return true;
 }
 
@@ -77,6 +91,7 @@ void IndexingService::Tick() {
   PollQueues();
   if (m_paused && m_resumeTime > 0 && static_cast<long long>(std::time(nullptr)) >= m_resumeTime)
     ReloadPause();
+  m_extraction.Wake();
   m_loop.After(kTickInterval, [this]() { Tick(); });
 }
 
@@ -95,7 +110,10 @@ void IndexingService::ReloadPause() {
       Log(LOG_INFO, m_paused ? "indexing paused until resumed" : "indexing resumed");
     }
   }
-  if (!m_paused) PollQueues();
+  if (!m_paused) {
+    PollQueues();
+    m_extraction.Wake();
+  }
 }
 
 void IndexingService::OpenIndexer(const std::string& name, Share& share, const ShareConfig& config) {
@@ -144,6 +162,7 @@ void IndexingService::ReloadConfig() {
     }
     Log(LOG_INFO, "share %s: no longer indexed", it->first.c_str());
     if (it->second.watch >= 0) ::inotify_rm_watch(m_inotify, it->second.watch);
+    m_extraction.Flush();
     it = m_shares.erase(it);
   }
   for (const auto& entry : configs) {
@@ -157,7 +176,10 @@ void IndexingService::ReloadConfig() {
       if (TAVO::FILEINDEX::StatusMgr::ShareIsNoSpace(name)) share.stop = Stop::kNoSpace;
     }
     WatchQueueDirectory(share, config.queuePath);
-    if (share.indexer && share.indexer->config().dbDirectory != config.dbDirectory) share.indexer.reset();
+    if (share.indexer && share.indexer->config().dbDirectory != config.dbDirectory) {
+      m_extraction.Flush();
+      share.indexer.reset();
+    }
     if (!share.indexer) {
       OpenIndexer(name, share, config);
     } else if (!share.indexer->Configure(config)) {
@@ -165,6 +187,7 @@ void IndexingService::ReloadConfig() {
     }
   }
   if (m_observer) m_observer(configs);
+  m_extraction.Wake();
 }
 
 void IndexingService::OnInotify() {
@@ -259,7 +282,9 @@ void IndexingService::RunSlice(milliseconds budget) {
   m_nextShare = name;
   if (share.stop != Stop::kNone || !share.indexer || !share.indexer->HasWork()) return;
   if (!HasSpace(name, share)) return;
-  if (share.indexer->RunSlice(Clock::now() + budget) == ShareIndexer::SliceResult::kStoreFailed) {
+  const ShareIndexer::SliceResult result = share.indexer->RunSlice(Clock::now() + budget);
+  m_extraction.Wake();
+  if (result == ShareIndexer::SliceResult::kStoreFailed) {
     const std::string& error = share.indexer->LastError();
     Log(LOG_ERR, "share %s: index write failed: %s", name.c_str(), error.c_str());
     if (error.find("full") != std::string::npos) {
@@ -290,6 +315,7 @@ void IndexingService::HandleCommand(const Json::Value& command) {
     if (stop) {
       m_stoppedByCommand.insert(share);
       if (it != m_shares.end()) {
+        m_extraction.Flush();
         it->second.stop = Stop::kByCommand;
         it->second.indexer.reset();  // its index is closed cleanly until it is revived
       }

@@ -12,6 +12,7 @@
 #include <set>
 #include <string>
 
+#include "extraction.h"
 #include "share_indexer.h"
 
 namespace fileindexd {
@@ -20,7 +21,7 @@ class IndexingService {
  public:
   using ConfigObserver = std::function<void(const std::map<std::string, ShareConfig>&)>;
 
-  explicit IndexingService(fileindex_daemon::EventLoop& loop) : m_loop(loop) {}
+  explicit IndexingService(fileindex_daemon::EventLoop& loop);
   ~IndexingService();
 
   // Told the shares served each time folder.conf has been read (before Start returns too).
@@ -66,6 +67,8 @@ class IndexingService {
   std::uint64_t m_pollTimer = 0;
   std::uint64_t m_pauseTimer = 0;
   ConfigObserver m_observer;
+  // Last, so that it goes first: it writes its results into the shares' indexes.
+  Extraction m_extraction;
 };
 
 }  // namespace fileindexd

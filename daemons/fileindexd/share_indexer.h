@@ -52,6 +52,13 @@ class ShareIndexer {
   // Figures for logs and tests.
   std::uint64_t entriesWritten() const { return m_entriesWritten; }
 
+  // For the extraction of contents, which writes into the same index between slices.
+  fileindex_store::IndexWriter& Store() { return *m_store; }
+  bool AllowsKind(const std::string& folder, fileindex_store::Kind kind) const {
+    return KindAllowed(folder, kind);
+  }
+  std::string PathOnDisk(const std::string& relative) const { return FullPath(relative); }
+
  private:
   enum class TaskType { kPath, kTree, kFolderCrawled, kFolderGone };
   struct Task {

@@ -26,6 +26,7 @@ void AddMiscCommands(CLI::App& app, Action& action);
 void AddCheckCommands(CLI::App& app, Action& action);
 void AddSandboxCommands(CLI::App& app, Action& action);
 void AddSearchCommand(CLI::App& app, Action& action);
+void AddWhyCommand(CLI::App& app, Action& action);
 
 }  // namespace fileindexctl
 

@@ -51,32 +51,36 @@ std::map<std::string, IndexedShare> IndexedShares(const std::vector<FI::Folder>&
   return shares;
 }
 
-void SearchShares(const std::map<std::string, IndexedShare>& shares, const fileindex_store::Query& query,
-                  std::vector<SearchHit>& hits, std::map<std::string, std::string>& unavailable) {
+void SearchShares(const std::map<std::string, IndexedShare>& shares,
+                  const fileindex_store::ContentQuery& query, std::vector<SearchHit>& hits,
+                  std::map<std::string, std::string>& unavailable) {
   for (const auto& entry : shares) {
     const IndexedShare& share = entry.second;
     std::string error;
-    auto reader = fileindex_store::IndexReader::Open(DatabaseDirectoryOf(share.name), error);
-    std::vector<fileindex_store::Hit> found;
+    auto reader = fileindex_store::ContentReader::Open(DatabaseDirectoryOf(share.name), error);
+    std::vector<fileindex_store::ContentHit> found;
     if (!reader || !reader->Search(query, found)) {
       unavailable[share.name] = reader ? reader->LastError() : error;
       continue;
     }
     std::vector<std::string> folders;
     for (const auto& folder : share.folderByPath) folders.push_back(folder.second);
-    for (fileindex_store::Hit& hit : found) {
+    for (fileindex_store::ContentHit& item : found) {
+      fileindex_store::Hit& hit = item.hit;
       if (std::find(folders.begin(), folders.end(), hit.folder) == folders.end()) continue;
       SearchHit result;
       result.share = share.name;
       result.path = "/" + share.name + (hit.path.empty() ? "" : "/" + hit.path);
       result.hit = std::move(hit);
+      result.hasContent = item.hasContent;
+      result.content = std::move(item.content);
       hits.push_back(std::move(result));
     }
   }
   std::stable_sort(hits.begin(), hits.end(), [](const SearchHit& a, const SearchHit& b) {
     return a.hit.mtime != b.hit.mtime ? a.hit.mtime > b.hit.mtime : a.path < b.path;
   });
-  if (hits.size() > query.limit) hits.resize(query.limit);
+  if (hits.size() > query.names.limit) hits.resize(query.names.limit);
 }
 
 ShareFigures FiguresOf(const IndexedShare& share) {

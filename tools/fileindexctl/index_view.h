@@ -3,6 +3,7 @@
 #ifndef FILEINDEXCTL_INDEX_VIEW_H
 #define FILEINDEXCTL_INDEX_VIEW_H
 
+#include <content.h>
 #include <fileindex/folder.h>
 #include <json/json.h>
 #include <store.h>
@@ -31,13 +32,16 @@ struct SearchHit {
   std::string share;
   std::string path;  // share path: "/" + share + "/" + path in the share
   fileindex_store::Hit hit;
+  bool hasContent = false;  // what is inside the file, once extracted
+  fileindex_store::Content content;
 };
 
-// Searches each share's index (newest first, at most query.limit in all); hits in folders
-// that are no longer configured are left out. Shares without an index yet are named in
-// `unavailable` with the reason.
-void SearchShares(const std::map<std::string, IndexedShare>& shares, const fileindex_store::Query& query,
-                  std::vector<SearchHit>& hits, std::map<std::string, std::string>& unavailable);
+// Searches each share's index (newest first, at most query.names.limit in all); hits in
+// folders that are no longer configured are left out. Shares without an index yet are
+// named in `unavailable` with the reason.
+void SearchShares(const std::map<std::string, IndexedShare>& shares,
+                  const fileindex_store::ContentQuery& query, std::vector<SearchHit>& hits,
+                  std::map<std::string, std::string>& unavailable);
 
 struct ShareFigures {
   bool indexAvailable = false;

@@ -88,6 +88,7 @@ int main(int argc, char** argv) {
   fileindexctl::AddMiscCommands(app, action);
   fileindexctl::AddSandboxCommands(app, action);
   fileindexctl::AddSearchCommand(app, action);
+  fileindexctl::AddWhyCommand(app, action);
 
   std::vector<std::string> helpWords;
   CLI::App* help = app.add_subcommand("help", "Show the help of a command: help [COMMAND [SUBCOMMAND]]");

@@ -6,6 +6,7 @@
 #include <memory>
 
 #include "commands.h"
+#include "content_view.h"
 #include "index_view.h"
 #include "output.h"
 
@@ -20,7 +21,35 @@ struct SearchArgs {
   std::string share;
   std::string kind;
   std::size_t limit = 50;
+  // Fields of the files' contents.
+  std::string title, artist, album, genre, camera, takenAfter, takenBefore, text;
+  std::int64_t year = 0;
 };
+
+// "YYYY-MM-DD" or "YYYY-MM-DD HH:MM[:SS]", as the index keeps the date a photo was taken.
+bool ValidDate(const std::string& date) {
+  static const char kPattern[] = "dddd-dd-dd dd:dd:dd";
+  if (date.size() != 10 && date.size() != 16 && date.size() != 19) return false;
+  for (std::size_t i = 0; i < date.size(); ++i) {
+    bool digit = date[i] >= '0' && date[i] <= '9';
+    if (kPattern[i] == 'd' ? !digit : date[i] != kPattern[i]) return false;
+  }
+  return true;
+}
+
+std::vector<std::string> Words(const std::string& text) {
+  std::vector<std::string> words;
+  std::string word;
+  for (char c : text + " ") {
+    if (c == ' ' || c == '\t') {
+      if (!word.empty()) words.push_back(word);
+      word.clear();
+    } else {
+      word += c;
+    }
+  }
+  return words;
+}
 
 std::string HumanSize(std::int64_t bytes) {
   const char* units[] = {"B", "KiB", "MiB", "GiB", "TiB"};
@@ -42,16 +71,36 @@ int Search(Session& s, const SearchArgs& args) {
     s.Fail("search", "only root may search the index (users search their shares through Samba)");
     return s.Finish(Json::Value(), nullptr);
   }
-  fileindex_store::Query query;
-  query.words = args.words;
-  query.limit = args.limit;
+  fileindex_store::ContentQuery query;
+  query.names.words = args.words;
+  query.names.limit = args.limit;
   if (!args.kind.empty()) {
-    query.anyKind = false;
-    if (!fileindex_store::KindFromName(args.kind, query.kind) ||
-        query.kind == fileindex_store::Kind::kOther) {
+    query.names.anyKind = false;
+    if (!fileindex_store::KindFromName(args.kind, query.names.kind) ||
+        query.names.kind == fileindex_store::Kind::kOther) {
       s.Usage("--kind must be document, audio, video or photo, not \"" + args.kind + "\"");
       return s.Finish(Json::Value(), nullptr);
     }
+  }
+  query.title = args.title;
+  query.artist = args.artist;
+  query.album = args.album;
+  query.genre = args.genre;
+  query.camera = args.camera;
+  query.year = args.year;
+  query.text = Words(args.text);
+  for (const std::string* date : {&args.takenAfter, &args.takenBefore}) {
+    if (!date->empty() && !ValidDate(*date)) {
+      s.Usage("--taken-after and --taken-before take YYYY-MM-DD or YYYY-MM-DD HH:MM[:SS], not \"" + *date +
+              "\"");
+      return s.Finish(Json::Value(), nullptr);
+    }
+  }
+  query.takenAfter = args.takenAfter;
+  query.takenBefore = args.takenBefore;
+  if (query.names.words.empty() && !query.Filters()) {
+    s.Usage("search needs words of names or a field filter (--artist, --camera, --text ...)");
+    return s.Finish(Json::Value(), nullptr);
   }
   std::vector<FI::Folder> folders;
   if (!s.Call("IndexMgr::List", [&]() { return FI::IndexMgr::List(folders); }))
@@ -79,6 +128,7 @@ int Search(Session& s, const SearchArgs& args) {
     item["kind"] = found.hit.isDir ? "" : fileindex_store::KindName(found.hit.kind);
     item["size"] = static_cast<Json::Int64>(found.hit.size);
     item["mtime"] = static_cast<Json::Int64>(found.hit.mtime);
+    item["content"] = found.hasContent ? ContentJson(found.content) : Json::Value();
     result["hits"].append(item);
   }
   result["count"] = static_cast<Json::UInt64>(hits.size());
@@ -91,11 +141,17 @@ int Search(Session& s, const SearchArgs& args) {
       std::printf("no match\n");
       return;
     }
-    Table table({"PATH", "KIND", "SIZE", "MODIFIED"});
+    Table table({"PATH", "KIND", "SIZE", "MODIFIED", "DETAILS"});
     for (const SearchHit& found : hits) {
+      std::string details;
+      if (found.hasContent) {
+        details = ContentSummary(found.content);
+      } else if (!found.hit.isDir && found.hit.kind != fileindex_store::Kind::kOther) {
+        details = "(contents pending)";
+      }
       table.AddRow({found.path + (found.hit.isDir ? "/" : ""),
                     found.hit.isDir ? "directory" : fileindex_store::KindName(found.hit.kind),
-                    found.hit.isDir ? "" : HumanSize(found.hit.size), LocalTime(found.hit.mtime)});
+                    found.hit.isDir ? "" : HumanSize(found.hit.size), LocalTime(found.hit.mtime), details});
     }
     table.Print(stdout);
   });
@@ -107,10 +163,22 @@ void AddSearchCommand(CLI::App& app, Action& action) {
   auto args = std::make_shared<SearchArgs>();
   CLI::App* cmd = app.add_subcommand(
       "search",
-      "Indexed files and directories whose names hold every word (as the start of a word), newest first");
-  cmd->add_option("words", args->words, "Words to look for (case-insensitive, accents ignored)")->required();
+      "Indexed files and directories whose names hold every word (as the start of a word) and whose contents "
+      "match every field filter, newest first");
+  cmd->add_option("words", args->words, "Words of names to look for (case-insensitive, accents ignored)");
   cmd->add_option("--share", args->share, "Only this share");
   cmd->add_option("--kind", args->kind, "Only files of this kind: document, audio, video or photo");
+  cmd->add_option("--title", args->title, "Title (of a song, video, document or photo) holding this text");
+  cmd->add_option("--artist", args->artist, "Artist holding this text");
+  cmd->add_option("--album", args->album, "Album holding this text");
+  cmd->add_option("--genre", args->genre, "Genre holding this text");
+  cmd->add_option("--year", args->year, "Year of a song")->check(CLI::Range(1, 9999));
+  cmd->add_option("--camera", args->camera, "Camera make or model holding this text");
+  cmd->add_option("--taken-after", args->takenAfter,
+                  "Photos taken at or after DATE (YYYY-MM-DD[ HH:MM[:SS]])");
+  cmd->add_option("--taken-before", args->takenBefore, "Photos taken on or before DATE");
+  cmd->add_option("--text", args->text,
+                  "Documents whose text holds every one of these WORDS (as word starts)");
   cmd->add_option("--limit", args->limit, "At most this many results")
       ->capture_default_str()
       ->check(CLI::Range(1, 100000));

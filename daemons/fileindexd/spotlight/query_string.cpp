@@ -329,7 +329,9 @@ class Parser {
             Condition::Of(Type::kNameGlob, phrase ? fileindex_store::EscapeGlob(value.literal) : value.glob);
         return true;
       case Field::kText:
-        out = Condition::Of(Type::kText, value.literal);
+        out = Condition::Of(Type::kText,
+                            phrase ? value.literal : fileindex_store::GlobLiteralPrefix(value.glob));
+        out.prefix = !phrase && value.wildcard;
         return true;
       case Field::kContentType:
         out = Condition::Of(Type::kContentType, value.literal);
@@ -372,9 +374,11 @@ class Parser {
     Condition words =
         Condition::Of(Type::kWords, phrase ? value.literal : fileindex_store::GlobLiteralPrefix(value.glob));
     words.prefix = wildcardAt != std::string::npos;
+    Condition text = words;
+    text.type = Type::kText;
     Condition either = Condition::Of(Type::kOr);
-    either.children.push_back(Condition::Of(Type::kText, words.text));
     either.children.push_back(std::move(words));
+    either.children.push_back(std::move(text));
     const bool trailingStarOnly = wildcardAt == std::string::npos ||
                                   (wildcardAt + 1 == value.glob.size() && value.glob[wildcardAt] == '*');
     if (trailingStarOnly) {
