@@ -42,6 +42,9 @@ bool SpotlightEndpoint::Start(const std::string& address, int port, std::string&
   http.set_read_timeout(kIdleSeconds, 0);
   http.set_write_timeout(kIdleSeconds, 0);
   http.set_keep_alive_timeout(kIdleSeconds);
+  // Samba keeps one connection per client session for all its pages and searches; the
+  // server's default of closing after five requests would make it connect again and again.
+  http.set_keep_alive_max_count(1000);
   // An answer goes out in more than one write: without this, the client's delayed
   // acknowledgement holds the last one back for tens of milliseconds.
   http.set_tcp_nodelay(true);
