@@ -10,7 +10,6 @@ namespace fileindex_store {
 
 namespace {
 
-const int kBusyTimeoutMs = 5000;
 
 // One row per extracted file, for the version (mtime, size) it was extracted from; the
 // text in a full-text table of its own whose rowid is the entry's id.
@@ -229,19 +228,10 @@ bool IndexWriter::PutContent(const ContentCandidate& candidate, const Content& c
 }
 
 std::unique_ptr<ContentReader> ContentReader::Open(const std::string& dbDir, std::string& error) {
+  sqlite3* db = OpenReadOnly(dbDir, error);
+  if (db == nullptr) return nullptr;
   const std::string file = IndexFilePath(dbDir);
-  if (::access(file.c_str(), F_OK) != 0) {
-    error = file + ": " + std::strerror(errno);
-    return nullptr;
-  }
-  sqlite3* db = nullptr;
-  int rc = sqlite3_open_v2(file.c_str(), &db, SQLITE_OPEN_READONLY | SQLITE_OPEN_NOFOLLOW, nullptr);
   std::unique_ptr<ContentReader> reader(new ContentReader(db));
-  if (rc != SQLITE_OK) {
-    error = file + ": " + (db != nullptr ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
-    return nullptr;
-  }
-  sqlite3_busy_timeout(db, kBusyTimeoutMs);
   Statement layout(db, "PRAGMA user_version");
   const int version = layout.ok() && layout.Step() == SQLITE_ROW ? static_cast<int>(layout.Int(0)) : -1;
   if (version != kLayoutVersion) {

@@ -374,7 +374,7 @@ void IndexWriter::Checkpoint() {
   sqlite3_wal_checkpoint_v2(m_db, nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr, nullptr);
 }
 
-std::unique_ptr<IndexReader> IndexReader::Open(const std::string& dbDir, std::string& error) {
+sqlite3* Database::OpenReadOnly(const std::string& dbDir, std::string& error) {
   const std::string file = IndexFilePath(dbDir);
   if (::access(file.c_str(), F_OK) != 0) {
     error = file + ": " + std::strerror(errno);
@@ -382,20 +382,24 @@ std::unique_ptr<IndexReader> IndexReader::Open(const std::string& dbDir, std::st
   }
   sqlite3* db = nullptr;
   int rc = sqlite3_open_v2(file.c_str(), &db, SQLITE_OPEN_READONLY | SQLITE_OPEN_NOFOLLOW, nullptr);
+  if (rc == SQLITE_OK) {
+    sqlite3_busy_timeout(db, kBusyTimeoutMs);
+    if (RegisterMatchingFunctions(db)) return db;
+  }
+  error = file + ": " + (db != nullptr ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
+  sqlite3_close_v2(db);
+  return nullptr;
+}
+
+std::unique_ptr<IndexReader> IndexReader::Open(const std::string& dbDir, std::string& error) {
+  sqlite3* db = OpenReadOnly(dbDir, error);
+  if (db == nullptr) return nullptr;
   std::unique_ptr<IndexReader> reader(new IndexReader(db));
-  if (rc != SQLITE_OK) {
-    error = file + ": " + (db != nullptr ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
-    return nullptr;
-  }
-  sqlite3_busy_timeout(db, kBusyTimeoutMs);
-  if (!RegisterMatchingFunctions(db)) {
-    error = file + ": " + sqlite3_errmsg(db);
-    return nullptr;
-  }
   Statement layout(db, "PRAGMA user_version");
   if (!layout.ok() || layout.Step() != SQLITE_ROW || layout.Int(0) > kLayoutVersion) {
-    error = file + ": index layout " + (layout.ok() ? std::to_string(layout.Int(0)) : "unreadable") +
-            " is not this program's (" + std::to_string(kLayoutVersion) + "); fileindexd rebuilds it";
+    error = IndexFilePath(dbDir) + ": index layout " +
+            (layout.ok() ? std::to_string(layout.Int(0)) : "unreadable") + " is not this program's (" +
+            std::to_string(kLayoutVersion) + "); fileindexd rebuilds it";
     return nullptr;
   }
   return reader;

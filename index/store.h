@@ -113,6 +113,9 @@ class Database {
 
  protected:
   explicit Database(sqlite3* db) : m_db(db) {}
+  // An existing index opened read-only, with the matching functions every connection
+  // needs; null with error set (and nothing left open) on failure.
+  static sqlite3* OpenReadOnly(const std::string& dbDir, std::string& error);
   bool Exec(const char* sql);
   Statement* Prepare(const char* sql);
   bool Fail(const char* what);
