@@ -482,18 +482,20 @@ inline std::string CheckFolderConf(const Env& env, const uint8_t* data, size_t s
 inline std::string CheckFolderConfView(const Env& env, const uint8_t* data, size_t size) {
   ResetState(env);
   const std::string text(reinterpret_cast<const char*>(data), size);
-  std::vector<fi::internal::FolderConfName> names;
-  if (fi::internal::ViewFolderConf(text.data(), text.size(), names)) {
+  // The records' values are checked against the parse by CheckFolderConf, through the load.
+  std::vector<fi::internal::FolderConfRecord> records;
+  if (fi::internal::ViewFolderConf(text.data(), text.size(), records)) {
     Json::Value doc;
     if (!fi::internal::JsonFromString(doc, text) || !doc.isObject())
       return "the fast reader decides what the strict parse refuses: " + Show(text);
     std::vector<std::string> viewed;
-    for (const auto& name : names) viewed.emplace_back(name.data, name.size);
+    for (const auto& record : records) viewed.emplace_back(record.path.data, record.path.size);
     if (viewed != doc.getMemberNames()) return "the fast reader lists other names: " + Show(text);
   }
   WriteBytes(env.FolderConf(), text);
   std::vector<std::string> probes{"/photo/a", "/photo/a/b/c", "/video", "/", ""};
-  if (!names.empty()) probes.emplace_back(std::string(names.back().data, names.back().size) + "/x");
+  if (!records.empty())
+    probes.emplace_back(std::string(records.back().path.data, records.back().path.size) + "/x");
   for (const std::string& probe : probes) {
     std::string answers[2];
     for (int full = 0; full < 2; ++full) {

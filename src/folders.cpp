@@ -3,6 +3,7 @@
 #include <fileindex/folders.h>
 #include <fileindex/utils.h>
 
+#include "internal/folder_conf_view.h"
 #include "internal/full_path_resolver.h"
 #include "internal/json_io.h"
 #include "internal/log.h"
@@ -40,35 +41,55 @@ std::string Folders::GetLockPath() const { return internal::SystemPath("/tmp/fil
 std::string Folders::GetPath() const { return internal::SystemPath("/usr/tavo/etc/fileindex/folder.conf"); }
 
 bool Folders::Load() {
+  // Each record is read as Folder::Load does, except that the full paths come from one
+  // resolver for the whole file, so a share holding many folders is looked up once.
+  internal::FullPathResolver resolver;
+  // The strings start empty; the flags start as the previous record left them.
+  bool flags[4] = {false, false, false, false};  // document, audio, video, photo
+  auto add = [&](std::string path, std::string name) {
+    Folder folder;
+    folder.m_strPath = std::move(path);
+    folder.m_strName = std::move(name);
+    folder.m_blDocument = flags[0];
+    folder.m_blAudio = flags[1];
+    folder.m_blVideo = flags[2];
+    folder.m_blPhoto = flags[3];
+    // A folder whose share cannot be resolved is kept, with an empty full path.
+    resolver.Resolve(folder.m_strFullPath, folder.m_strPath);
+    // Members come in ascending key order, so the end is the right hint.
+    const std::string key = folder.m_strPath;
+    m_mapFolders.emplace_hint(m_mapFolders.end(), key, std::move(folder));
+  };
+
+  // folder.conf as the library writes it is read without building the document; every
+  // other text (and a missing file) is left to the strict parse, the authority.
+  const std::string path = GetPath();
+  std::string text;
+  std::vector<internal::FolderConfRecord> records;
+  if (IsFileExist(path) && internal::ReadWholeFile(path, text) &&
+      internal::ViewFolderConf(text.data(), text.size(), records)) {
+    for (const internal::FolderConfRecord& record : records) {
+      for (int i = 0; i < 4; ++i) {
+        if (record.flags[i] >= 0) flags[i] = record.flags[i] != 0;
+      }
+      add(std::string(record.path.data, record.path.size),
+          record.name != nullptr ? std::string(record.name, record.nameSize) : std::string());
+    }
+    return true;
+  }
+
   if (!LoadJson()) return false;
   if (!m_jsDocument.isObject()) {
     FIDX_LOG("Malformed folders: %s", internal::JsonToString(m_jsDocument).c_str());
     ErrorHandler::SetError(FILEINDEX_ERR_MALFORMED_CONFIG);
     return false;
   }
-  // Reads each record as Folder::Load does, except that the full paths come from one
-  // resolver for the whole file, so a share holding many folders is looked up once.
-  internal::FullPathResolver resolver;
-  bool document = false, audio = false, video = false, photo = false;
   for (Json::Value::const_iterator it = m_jsDocument.begin(); it != m_jsDocument.end(); ++it) {
     const Json::Value& record = *it;
-    // The strings start empty; the flags start as the previous record left them.
-    Folder folder;
-    folder.m_strPath = it.name();
-    RetrieveStringFromJsonObj(folder.m_strName, "name", record);
-    RetrieveBoolFromJsonObj(document, "document", record);
-    RetrieveBoolFromJsonObj(audio, "audio", record);
-    RetrieveBoolFromJsonObj(video, "video", record);
-    RetrieveBoolFromJsonObj(photo, "photo", record);
-    folder.m_blDocument = document;
-    folder.m_blAudio = audio;
-    folder.m_blVideo = video;
-    folder.m_blPhoto = photo;
-    // A folder whose share cannot be resolved is kept, with an empty full path.
-    resolver.Resolve(folder.m_strFullPath, folder.m_strPath);
-    // Members come in ascending key order, so the end is the right hint.
-    const std::string key = folder.m_strPath;
-    m_mapFolders.emplace_hint(m_mapFolders.end(), key, std::move(folder));
+    std::string name;
+    RetrieveStringFromJsonObj(name, "name", record);
+    for (int i = 0; i < 4; ++i) RetrieveBoolFromJsonObj(flags[i], kFlags[i], record);
+    add(it.name(), std::move(name));
   }
   return true;
 }

@@ -37,15 +37,15 @@ struct QuickFolders {
   bool Read(bool wantFulls) {
     const std::string confPath = Folders().GetPath();
     std::string text;
-    std::vector<internal::FolderConfName> names;
+    std::vector<internal::FolderConfRecord> records;
     if (!IsFileExist(confPath) || !internal::ReadWholeFile(confPath, text) ||
-        !internal::ViewFolderConf(text.data(), text.size(), names))
+        !internal::ViewFolderConf(text.data(), text.size(), records))
       return false;
     internal::FullPathResolver resolver;
-    paths.reserve(names.size());
-    if (wantFulls) fulls.reserve(names.size());
-    for (const internal::FolderConfName& name : names) {
-      paths.emplace_back(name.data, name.size);
+    paths.reserve(records.size());
+    if (wantFulls) fulls.reserve(records.size());
+    for (const internal::FolderConfRecord& record : records) {
+      paths.emplace_back(record.path.data, record.path.size);
       std::string full;
       resolver.Resolve(full, paths.back());
       if (wantFulls) fulls.push_back(std::move(full));

@@ -88,11 +88,39 @@ TEST_F(QueriesTest, GetTakesTheLockAndReleasesItOnEveryWayOut) {
   config.Unlock();
 }
 
+// Each record as a folder is loaded from it: its path, then "name" when a string, then
+// each flag held as a boolean ("-" when not).
+std::vector<std::string> Described(const std::vector<internal::FolderConfRecord>& records) {
+  std::vector<std::string> out;
+  for (const auto& r : records) {
+    std::string line(r.path.data, r.path.size);
+    line += r.name != nullptr ? "|" + std::string(r.name, r.nameSize) : "|-";
+    for (signed char flag : r.flags) line += flag < 0 ? "-" : std::to_string(flag);
+    out.push_back(line);
+  }
+  return out;
+}
+
+std::vector<std::string> Described(const Json::Value& doc) {
+  std::vector<std::string> out;
+  for (auto it = doc.begin(); it != doc.end(); ++it) {
+    const Json::Value& r = *it;
+    std::string line = it.name();
+    line += r.isObject() && r["name"].isString() ? "|" + r["name"].asString() : "|-";
+    for (const char* flag : {"document", "audio", "video", "photo"})
+      line += !r.isObject() || !r[flag].isBool() ? "-" : r[flag].asBool() ? "1" : "0";
+    out.push_back(line);
+  }
+  return out;
+}
+
 // Guards the fast reader of folder.conf: wherever it decides a text, the strict parse
-// must read an object with exactly these member names in this order. Hand-picked texts
-// plus every one-byte deletion and insertion of a delimiter into them.
+// must read an object with exactly these records, in this order, holding these values.
+// Hand-picked texts plus every one-byte deletion and insertion of a delimiter into them.
 TEST(FolderConfViewTest, AgreesWithTheStrictParseWhereverItDecides) {
   const std::vector<std::string> seeds{
+      R"({"/a":{"audio":1,"name":null,"photo":true},"/b":"x","/c":{"document":false,"name":"plain","video":"true","x":{"name":"in","audio":true}}})",
+      R"({"/d":{"audio":true,"audio":false},"/e":{"name":"a","name":"b"},"/f":{"name":"c","photo":false}})",
       R"({"/a/b":{"name":"x","document":true,"audio":false},"/a/c":{"name":"q\"\\\/\b\f\n\r\t\u00e9\ud83d\ude00"}})",
       "{\n  \"\" : { \"n\" : [ 1, -2, 0, null, { } ] },\r\n\t\"/v\" : {\"path\":\"/v\",\"x\":-0} }\n",
       R"({"/a":{},"/a/":{},"/b":[],"/b\u0000":{},"/\u00e9":{}, "/b":{}})",
@@ -111,28 +139,26 @@ TEST(FolderConfViewTest, AgreesWithTheStrictParseWhereverItDecides) {
   texts.push_back("{\"/d\":" + std::string(70, '[') + std::string(70, ']') + "}");
   int decided = 0;
   for (const std::string& text : texts) {
-    std::vector<internal::FolderConfName> names;
-    if (!internal::ViewFolderConf(text.data(), text.size(), names)) continue;
+    std::vector<internal::FolderConfRecord> records;
+    if (!internal::ViewFolderConf(text.data(), text.size(), records)) continue;
     ++decided;
     Json::Value parsed;
     ASSERT_TRUE(internal::JsonFromString(parsed, text)) << text;
     ASSERT_TRUE(parsed.isObject()) << text;
-    std::vector<std::string> viewed;
-    for (const auto& name : names) viewed.emplace_back(name.data, name.size);
-    EXPECT_EQ(viewed, parsed.getMemberNames()) << text;
+    EXPECT_EQ(Described(records), Described(parsed)) << text;
   }
-  EXPECT_GT(decided, 200);
+  EXPECT_GT(decided, 300);
   // The forms the library itself writes are always decided.
-  for (const std::string& text : {seeds[0], seeds[1], seeds[4], std::string("{}")}) {
-    std::vector<internal::FolderConfName> names;
-    EXPECT_TRUE(internal::ViewFolderConf(text.data(), text.size(), names)) << text;
+  for (const std::string& text : {seeds[0], seeds[3], seeds[6], std::string("{}")}) {
+    std::vector<internal::FolderConfRecord> records;
+    EXPECT_TRUE(internal::ViewFolderConf(text.data(), text.size(), records)) << text;
   }
 }
 
-// Guards that a query answered through the fast reader gives the answer, the log lines,
-// the error code and the platform calls of one answered through the full load: each
-// folder.conf is asked once as written and once with its names escaped ("\/"), which
-// the fast reader leaves to the load.
+// Guards that a query or a load answered through the fast reader gives the answer, the
+// folders, the log lines, the error code and the platform calls of one answered through
+// the strict parse: each folder.conf is asked once as written and once with its names
+// escaped ("\/"), which the fast reader leaves to the parse.
 TEST_F(QueriesTest, FastReaderMatchesTheFullLoad) {
   AddShare("video");
   AddShare("photo");
@@ -143,8 +169,9 @@ TEST_F(QueriesTest, FastReaderMatchesTheFullLoad) {
     Json::Value conf(Json::objectValue);
     for (int i = 0; i < n; ++i) {
       const std::string path = std::string("/") + shares[rng() % 3] + "/d" + std::to_string(rng() % 20);
-      conf[path]["name"] = std::string("n\"\\\x01\xc3\xa9") + std::to_string(i);
-      conf[path]["document"] = rng() % 2 == 0;
+      conf[path]["name"] = std::string("n\xc3\xa9") + std::to_string(i);
+      conf[path][rng() % 2 == 0 ? "document" : "photo"] = rng() % 2 == 0;
+      if (i % 7 == 3) conf[path]["audio"] = "yes";
       conf[path]["path"] = path;
     }
     if (n == 5) conf[""]["name"] = "no share";
@@ -169,6 +196,13 @@ TEST_F(QueriesTest, FastReaderMatchesTheFullLoad) {
       for (const std::string& line : logcap::Texts()) seen.push_back(line);
       for (const std::string& call : fake::Get().calls) seen.push_back(call);
     }
+    std::vector<Folder> folders;
+    seen.push_back(std::to_string(IndexMgr::List(folders)));
+    for (const Folder& f : folders) {
+      seen.push_back(f.GetPath() + "|" + f.GetName() + "|" + f.GetFullPath() + "|" +
+                     std::to_string(f.IsDocument()) + std::to_string(f.IsAudio()) +
+                     std::to_string(f.IsVideo()) + std::to_string(f.IsPhoto()));
+    }
     return seen;
   };
   int indexed = 0;
@@ -176,9 +210,9 @@ TEST_F(QueriesTest, FastReaderMatchesTheFullLoad) {
     const std::string text = internal::JsonToString(conf);
     std::string escaped;
     for (char c : text) escaped += c == '/' ? std::string("\\/") : std::string(1, c);
-    std::vector<internal::FolderConfName> names;
-    ASSERT_TRUE(internal::ViewFolderConf(text.data(), text.size(), names)) << text;
-    ASSERT_TRUE(conf.empty() || !internal::ViewFolderConf(escaped.data(), escaped.size(), names));
+    std::vector<internal::FolderConfRecord> records;
+    ASSERT_TRUE(internal::ViewFolderConf(text.data(), text.size(), records)) << text;
+    ASSERT_TRUE(conf.empty() || !internal::ViewFolderConf(escaped.data(), escaped.size(), records));
     const std::vector<std::string> fast = ask(text);
     EXPECT_EQ(fast, ask(escaped)) << text;
     for (const std::string& line : fast) indexed += line.compare(0, 2, "11") == 0;

@@ -39,7 +39,7 @@ class Reader {
  public:
   explicit Reader(const char* end) : end_(end) {}
 
-  const char* Root(const char* p, std::vector<FolderConfName>& names) const {
+  const char* Root(const char* p, std::vector<FolderConfRecord>& records) const {
     p = SkipSpaces(p);
     if (!At(p, '{')) return nullptr;
     p = SkipSpaces(p + 1);
@@ -51,13 +51,15 @@ class Reader {
       p = String(p, escaped);
       // An escaped name would have to be decoded to be compared.
       if (p == nullptr || escaped) return nullptr;
-      const FolderConfName name{begin, static_cast<size_t>(p - 1 - begin)};
-      if (name.size >= kMaxName || (!names.empty() && !Before(names.back(), name))) return nullptr;
-      names.push_back(name);
+      FolderConfRecord record{{begin, static_cast<size_t>(p - 1 - begin)}, nullptr, 0, {-1, -1, -1, -1}};
+      if (record.path.size >= kMaxName || (!records.empty() && !Before(records.back().path, record.path)))
+        return nullptr;
       p = SkipSpaces(p);
       if (!At(p, ':')) return nullptr;
-      p = Value(SkipSpaces(p + 1), 1);
+      p = SkipSpaces(p + 1);
+      p = At(p, '{') ? Record(p, record) : Value(p, 1);
       if (p == nullptr) return nullptr;
+      records.push_back(record);
       p = SkipSpaces(p);
       if (At(p, ',')) {
         p = SkipSpaces(p + 1);
@@ -186,6 +188,64 @@ class Reader {
     }
   }
 
+  // A folder's record, an object at depth 1, as Container reads it, noting the members
+  // a folder is loaded from.
+  const char* Record(const char* p, FolderConfRecord& record) const {
+    static const char* const kFlags[] = {"document", "audio", "video", "photo"};
+    // Which of the flags and "name" the record has held so far.
+    bool seen[5] = {false, false, false, false, false};
+    p = SkipSpaces(p + 1);
+    if (At(p, '}')) return p + 1;
+    for (;;) {
+      if (!At(p, '"')) return nullptr;
+      const char* begin = p + 1;
+      bool escaped;
+      p = String(p, escaped);
+      // An escaped member name might spell one of those above.
+      if (p == nullptr || escaped) return nullptr;
+      const FolderConfName member{begin, static_cast<size_t>(p - 1 - begin)};
+      p = SkipSpaces(p);
+      if (!At(p, ':')) return nullptr;
+      p = SkipSpaces(p + 1);
+      int flag = -1;
+      for (int i = 0; i < 4; ++i) {
+        if (Is(member, kFlags[i])) flag = i;
+      }
+      if (flag >= 0) {
+        // The parsed record keeps the last of repeated members: left to the parse.
+        if (seen[flag]) return nullptr;
+        seen[flag] = true;
+        if (At(p, 't') || At(p, 'f')) record.flags[flag] = At(p, 't') ? 1 : 0;
+        p = Value(p, 2);
+      } else if (Is(member, "name")) {
+        if (seen[4]) return nullptr;
+        seen[4] = true;
+        if (At(p, '"')) {
+          const char* text = p + 1;
+          p = String(p, escaped);
+          if (p == nullptr || escaped) return nullptr;
+          record.name = text;
+          record.nameSize = static_cast<size_t>(p - 1 - text);
+        } else {
+          p = Value(p, 2);
+        }
+      } else {
+        p = Value(p, 2);
+      }
+      if (p == nullptr) return nullptr;
+      p = SkipSpaces(p);
+      if (At(p, ',')) {
+        p = SkipSpaces(p + 1);
+        continue;
+      }
+      return At(p, '}') ? p + 1 : nullptr;
+    }
+  }
+
+  static bool Is(const FolderConfName& name, const char* word) {
+    return name.size == std::strlen(word) && std::memcmp(name.data, word, name.size) == 0;
+  }
+
   const char* Container(const char* p, int depth, char close, bool object) const {
     if (depth >= kMaxDepth) return nullptr;
     p = SkipSpaces(p + 1);
@@ -218,14 +278,14 @@ class Reader {
 
 }  // namespace
 
-bool ViewFolderConf(const char* data, size_t size, std::vector<FolderConfName>& names) {
-  names.clear();
+bool ViewFolderConf(const char* data, size_t size, std::vector<FolderConfRecord>& records) {
+  records.clear();
   const Reader reader(data + size);
-  const char* p = reader.Root(data, names);
+  const char* p = reader.Root(data, records);
   // Only blanks may follow the object (a NUL byte, which the JSON library takes for the
   // end of the text, is left to it).
   if (p == nullptr || reader.SkipSpaces(p) != data + size) {
-    names.clear();
+    records.clear();
     return false;
   }
   return true;
