@@ -42,31 +42,16 @@ class Reader {
   const char* Root(const char* p, std::vector<FolderConfRecord>& records) const {
     p = SkipSpaces(p);
     if (!At(p, '{')) return nullptr;
-    p = SkipSpaces(p + 1);
-    if (At(p, '}')) return p + 1;
-    for (;;) {
-      if (!At(p, '"')) return nullptr;
-      const char* begin = p + 1;
-      bool escaped;
-      p = String(p, escaped);
-      // An escaped name would have to be decoded to be compared.
-      if (p == nullptr || escaped) return nullptr;
-      FolderConfRecord record{{begin, static_cast<size_t>(p - 1 - begin)}, nullptr, 0, {-1, -1, -1, -1}};
-      if (record.path.size >= kMaxName || (!records.empty() && !Before(records.back().path, record.path)))
-        return nullptr;
-      p = SkipSpaces(p);
-      if (!At(p, ':')) return nullptr;
-      p = SkipSpaces(p + 1);
-      p = At(p, '{') ? Record(p, record) : Value(p, 1);
-      if (p == nullptr) return nullptr;
-      records.push_back(record);
-      p = SkipSpaces(p);
-      if (At(p, ',')) {
-        p = SkipSpaces(p + 1);
-        continue;
-      }
-      return At(p, '}') ? p + 1 : nullptr;
-    }
+    return Elements(
+        p, '}', true, [&](const FolderConfName& path, bool escaped, const char* value) -> const char* {
+          // An escaped name would have to be decoded to be compared.
+          if (escaped || path.size >= kMaxName || (!records.empty() && !Before(records.back().path, path)))
+            return nullptr;
+          FolderConfRecord record{path, nullptr, 0, {-1, -1, -1, -1}};
+          value = At(value, '{') ? Record(value, record) : Value(value, 1);
+          if (value != nullptr) records.push_back(record);
+          return value;
+        });
   }
 
   FIDX_HOT const char* SkipSpaces(const char* p) const {
@@ -194,52 +179,30 @@ class Reader {
     static const char* const kFlags[] = {"document", "audio", "video", "photo"};
     // Which of the flags and "name" the record has held so far.
     bool seen[5] = {false, false, false, false, false};
-    p = SkipSpaces(p + 1);
-    if (At(p, '}')) return p + 1;
-    for (;;) {
-      if (!At(p, '"')) return nullptr;
-      const char* begin = p + 1;
-      bool escaped;
-      p = String(p, escaped);
-      // An escaped member name might spell one of those above.
-      if (p == nullptr || escaped) return nullptr;
-      const FolderConfName member{begin, static_cast<size_t>(p - 1 - begin)};
-      p = SkipSpaces(p);
-      if (!At(p, ':')) return nullptr;
-      p = SkipSpaces(p + 1);
-      int flag = -1;
-      for (int i = 0; i < 4; ++i) {
-        if (Is(member, kFlags[i])) flag = i;
-      }
-      if (flag >= 0) {
-        // The parsed record keeps the last of repeated members: left to the parse.
-        if (seen[flag]) return nullptr;
-        seen[flag] = true;
-        if (At(p, 't') || At(p, 'f')) record.flags[flag] = At(p, 't') ? 1 : 0;
-        p = Value(p, 2);
-      } else if (Is(member, "name")) {
-        if (seen[4]) return nullptr;
-        seen[4] = true;
-        if (At(p, '"')) {
-          const char* text = p + 1;
-          p = String(p, escaped);
-          if (p == nullptr || escaped) return nullptr;
-          record.name = text;
-          record.nameSize = static_cast<size_t>(p - 1 - text);
-        } else {
-          p = Value(p, 2);
-        }
-      } else {
-        p = Value(p, 2);
-      }
-      if (p == nullptr) return nullptr;
-      p = SkipSpaces(p);
-      if (At(p, ',')) {
-        p = SkipSpaces(p + 1);
-        continue;
-      }
-      return At(p, '}') ? p + 1 : nullptr;
-    }
+    return Elements(p, '}', true,
+                    [&](const FolderConfName& member, bool escaped, const char* value) -> const char* {
+                      // An escaped member name might spell one of those above.
+                      if (escaped) return nullptr;
+                      int known = -1;
+                      for (int i = 0; i < 4; ++i) {
+                        if (Is(member, kFlags[i])) known = i;
+                      }
+                      if (Is(member, "name")) known = 4;
+                      if (known < 0) return Value(value, 2);
+                      // The parsed record keeps the last of repeated members: left to the parse.
+                      if (seen[known]) return nullptr;
+                      seen[known] = true;
+                      if (known < 4) {
+                        if (At(value, 't') || At(value, 'f')) record.flags[known] = At(value, 't') ? 1 : 0;
+                        return Value(value, 2);
+                      }
+                      if (!At(value, '"')) return Value(value, 2);
+                      const char* end = String(value, escaped);
+                      if (end == nullptr || escaped) return nullptr;
+                      record.name = value + 1;
+                      record.nameSize = static_cast<size_t>(end - 1 - record.name);
+                      return end;
+                    });
   }
 
   static bool Is(const FolderConfName& name, const char* word) {
@@ -248,19 +211,31 @@ class Reader {
 
   const char* Container(const char* p, int depth, char close, bool object) const {
     if (depth >= kMaxDepth) return nullptr;
+    return Elements(p, close, object,
+                    [&](const FolderConfName&, bool, const char* value) { return Value(value, depth + 1); });
+  }
+
+  // At the "{" or "[" of a container: each element handed to element(name, escaped,
+  // value), name empty in an array and value where the element's value begins, which
+  // returns the position after the value.
+  template <typename Element>
+  const char* Elements(const char* p, char close, bool object, Element&& element) const {
     p = SkipSpaces(p + 1);
     if (At(p, close)) return p + 1;
     for (;;) {
+      FolderConfName name{p, 0};
+      bool escaped = false;
       if (object) {
-        bool escaped;
         if (!At(p, '"')) return nullptr;
         p = String(p, escaped);
         if (p == nullptr) return nullptr;
+        name.data += 1;
+        name.size = static_cast<size_t>(p - 1 - name.data);
         p = SkipSpaces(p);
         if (!At(p, ':')) return nullptr;
         p = SkipSpaces(p + 1);
       }
-      p = Value(p, depth + 1);
+      p = element(name, escaped, p);
       if (p == nullptr) return nullptr;
       p = SkipSpaces(p);
       if (At(p, ',')) {
