@@ -5,6 +5,7 @@
 #include <unicode/normalizer2.h>
 #include <unicode/uchar.h>
 #include <unicode/unistr.h>
+#include <unicode/uversion.h>
 
 #include <algorithm>
 #include <cctype>
@@ -319,6 +320,16 @@ bool ContentTypeMatches(const std::string& pattern, const std::string& contentTy
   if (p.size() >= 2 && p.compare(p.size() - 2, 2, "/*") == 0)
     return type.compare(0, p.size() - 1, p, 0, p.size() - 1) == 0;
   return p == type;
+}
+
+std::string FoldingVersion() {
+  UVersionInfo icu, unicode;
+  u_getVersion(icu);
+  u_getUnicodeVersion(unicode);
+  char icuText[U_MAX_VERSION_STRING_LENGTH], unicodeText[U_MAX_VERSION_STRING_LENGTH];
+  u_versionToString(icu, icuText);
+  u_versionToString(unicode, unicodeText);
+  return std::string("icu ") + icuText + ", unicode " + unicodeText;
 }
 
 std::string FoldForMatching(const std::string& utf8) {

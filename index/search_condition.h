@@ -66,6 +66,10 @@ bool ContentTypeMatches(const std::string& pattern, const std::string& contentTy
 // Case and accents folded away, for comparing names as people type them.
 std::string FoldForMatching(const std::string& utf8);
 
+// Which folding FoldForMatching does: the ICU and Unicode versions it runs with. An index
+// built on the folding of other versions has to be rebuilt.
+std::string FoldingVersion();
+
 // A glob matching exactly the literal text.
 std::string EscapeGlob(const std::string& literal);
 

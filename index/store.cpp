@@ -199,11 +199,31 @@ std::unique_ptr<IndexWriter> IndexWriter::Open(const std::string& dbDir, std::st
     return nullptr;
   }
   Statement* version = writer->Prepare("INSERT OR IGNORE INTO meta(key, value) VALUES ('schema', ?)");
-  if (version == nullptr || version->Bind(std::to_string(kSchemaVersion)).Step() != SQLITE_DONE) {
+  if (version == nullptr || version->Bind(std::to_string(kSchemaVersion)).Step() != SQLITE_DONE ||
+      !writer->KeepFoldedNamesInStep()) {
     error = file + ": " + writer->LastError();
     return nullptr;
   }
   return writer;
+}
+
+bool IndexWriter::KeepFoldedNamesInStep() {
+  // The folded-name index holds each name as this ICU folds it. Built by another ICU
+  // (an upgrade), its order is not the one searches seek in, and names would be missed:
+  // it is built again, once, from the names.
+  const std::string folding = FoldingVersion();
+  Statement* stored = Prepare("SELECT value FROM meta WHERE key = 'folding'");
+  if (stored == nullptr) return false;
+  const int rc = stored->Step();
+  if (rc == SQLITE_ROW && stored->Text(0) == folding) return true;
+  if (rc != SQLITE_ROW && rc != SQLITE_DONE) return Fail("read folding");
+  stored->Reset();
+  Statement* store = Prepare("INSERT OR REPLACE INTO meta(key, value) VALUES ('folding', ?)");
+  if (store == nullptr || !Begin()) return false;
+  if (Exec("REINDEX entries_by_folded_name") && store->Bind(folding).Step() == SQLITE_DONE && Commit())
+    return true;
+  Rollback();
+  return false;
 }
 
 bool IndexWriter::Begin() { return Exec("BEGIN IMMEDIATE"); }

@@ -170,6 +170,8 @@ class IndexWriter : public Database {
   int LayoutVersion();
   // Creates the content tables and marks the layout as current.
   bool UpgradeLayout();
+  // Rebuilds the folded-name index when it was built with another folding.
+  bool KeepFoldedNamesInStep();
 
   std::int64_t m_textBytes = -1;  // text kept in all; -1 until first needed
 };

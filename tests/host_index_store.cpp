@@ -6,6 +6,7 @@
 #include <store.h>
 #include <sys/stat.h>
 
+#include <cctype>
 #include <cstdlib>
 #include <filesystem>
 #include <set>
@@ -222,6 +223,46 @@ TEST_F(IndexStoreTest, ContentFollowsItsEntryAndLayoutsAreMigratedOrRebuilt) {
   writer_ = IndexWriter::Open(dir_ + "/db", error);
   ASSERT_TRUE(writer_) << error;
   EXPECT_TRUE(All().empty());
+}
+
+// A folded-name index built with another folding (as after an ICU upgrade) misses names
+// in prefix searches until the writer, on opening, builds it again.
+TEST_F(IndexStoreTest, FoldedNamesAreRebuiltForAnotherFolding) {
+  Put("docs", "Beach One.jpg");
+  writer_.reset();
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open((dir_ + "/db/index.sqlite3").c_str(), &db), SQLITE_OK);
+  auto upper = [](sqlite3_context* context, int, sqlite3_value** values) {
+    std::string text = reinterpret_cast<const char*>(sqlite3_value_text(values[0]));
+    for (char& c : text) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+    sqlite3_result_text(context, text.c_str(), -1, SQLITE_TRANSIENT);
+  };
+  sqlite3_create_function_v2(db, "fi_fold", 1, SQLITE_UTF8 | SQLITE_DETERMINISTIC, nullptr, upper, nullptr,
+                             nullptr, nullptr);
+  ASSERT_EQ(sqlite3_exec(
+                db, "REINDEX entries_by_folded_name; UPDATE meta SET value = 'other' WHERE key = 'folding'",
+                nullptr, nullptr, nullptr),
+            SQLITE_OK)
+      << sqlite3_errmsg(db);
+  sqlite3_close(db);
+  auto prefixed = [this] {
+    sqlite3* reader = nullptr;
+    sqlite3_open_v2((dir_ + "/db/index.sqlite3").c_str(), &reader, SQLITE_OPEN_READONLY, nullptr);
+    EXPECT_TRUE(RegisterMatchingFunctions(reader));
+    sqlite3_stmt* statement = nullptr;
+    sqlite3_prepare_v2(
+        reader, "SELECT count(*) FROM entries WHERE fi_fold(name) >= 'beach' AND fi_fold(name) < 'beachz'",
+        -1, &statement, nullptr);
+    const int count = sqlite3_step(statement) == SQLITE_ROW ? sqlite3_column_int(statement, 0) : -1;
+    sqlite3_finalize(statement);
+    sqlite3_close(reader);
+    return count;
+  };
+  EXPECT_EQ(prefixed(), 0);
+  std::string error;
+  writer_ = IndexWriter::Open(dir_ + "/db", error);
+  ASSERT_TRUE(writer_) << error;
+  EXPECT_EQ(prefixed(), 1);
 }
 
 }  // namespace
