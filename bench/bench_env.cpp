@@ -11,6 +11,7 @@
 #include <memory>
 #include <stdexcept>
 
+#include "internal/json_io.h"
 #include "support/fake_platform.h"
 
 namespace bench {
@@ -216,32 +217,9 @@ void WarmPageCache(const std::string& path) {
 
 namespace {
 
-// Configured like the library's own reader, so that both read the same lines the same way.
-const Json::CharReaderBuilder& NaiveBuilder() {
-  static const Json::CharReaderBuilder builder = [] {
-    Json::CharReaderBuilder b;
-    b["allowComments"] = false;
-    b["allowTrailingCommas"] = false;
-    b["allowSingleQuotes"] = false;
-    b["allowSpecialFloats"] = false;
-    b["allowNumericKeys"] = false;
-    b["allowDroppedNullPlaceholders"] = false;
-    b["strictRoot"] = false;
-    b["rejectDupKeys"] = false;
-    b["failIfExtra"] = true;
-    b["collectComments"] = false;
-    return b;
-  }();
-  return builder;
-}
-
+// A JSON document per line, parsed as the library parses its files.
 bool NaiveParse(const std::string& line, Json::Value& value) {
-  std::unique_ptr<Json::CharReader> reader(NaiveBuilder().newCharReader());
-  try {
-    if (!reader->parse(line.data(), line.data() + line.size(), &value, nullptr)) return false;
-  } catch (const std::exception&) {
-    return false;
-  }
+  if (!TAVO::FILEINDEX::internal::JsonFromString(value, line)) return false;
   return value.isObject() && value.isMember("event") && value.isMember("path") &&
          value["event"].isConvertibleTo(Json::uintValue) && value["path"].isString();
 }
