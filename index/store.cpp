@@ -130,8 +130,16 @@ Database::~Database() {
   sqlite3_close_v2(m_db);
 }
 
+namespace {
+bool IsDamage(int code) {
+  code &= 0xff;
+  return code == SQLITE_CORRUPT || code == SQLITE_NOTADB;
+}
+}  // namespace
+
 bool Database::Fail(const char* what) {
   m_error = std::string(what) + ": " + sqlite3_errmsg(m_db);
+  m_damaged = IsDamage(sqlite3_errcode(m_db));
   return false;
 }
 
@@ -139,6 +147,7 @@ bool Database::Exec(const char* sql) {
   char* message = nullptr;
   if (sqlite3_exec(m_db, sql, nullptr, nullptr, &message) == SQLITE_OK) return true;
   m_error = message != nullptr ? message : sqlite3_errmsg(m_db);
+  m_damaged = IsDamage(sqlite3_errcode(m_db));
   sqlite3_free(message);
   return false;
 }
@@ -158,6 +167,33 @@ Statement* Database::Prepare(const char* sql) {
 }
 
 std::unique_ptr<IndexWriter> IndexWriter::Open(const std::string& dbDir, std::string& error) {
+  bool damaged = false;
+  std::unique_ptr<IndexWriter> writer = OpenFile(dbDir, error, damaged);
+  if (writer || !damaged) return writer;
+  // Everything an index holds can be found again on disk; the damaged file is kept for
+  // whoever wants to look into it.
+  const std::string why = error;
+  if (!SetAside(dbDir, error)) return nullptr;
+  writer = OpenFile(dbDir, error, damaged);
+  if (writer) writer->m_setAsideNote = why + "; it is kept as " + IndexFilePath(dbDir) + ".damaged";
+  return writer;
+}
+
+bool IndexWriter::SetAside(const std::string& dbDir, std::string& error) {
+  const std::string file = IndexFilePath(dbDir);
+  for (const char* suffix : {"", "-wal"}) {
+    const std::string from = file + suffix, to = file + ".damaged" + suffix;
+    if (::rename(from.c_str(), to.c_str()) != 0 && errno != ENOENT) {
+      error = from + ": " + std::strerror(errno);
+      return false;
+    }
+  }
+  ::unlink((file + "-shm").c_str());
+  return true;
+}
+
+std::unique_ptr<IndexWriter> IndexWriter::OpenFile(const std::string& dbDir, std::string& error,
+                                                   bool& damaged) {
   // File names are private: only the owner (root) may list or read the index.
   if (::mkdir(dbDir.c_str(), 0700) != 0 && errno != EEXIST) {
     error = dbDir + ": " + std::strerror(errno);
@@ -179,6 +215,7 @@ std::unique_ptr<IndexWriter> IndexWriter::Open(const std::string& dbDir, std::st
   std::unique_ptr<IndexWriter> writer(new IndexWriter(db));
   if (rc != SQLITE_OK) {
     error = file + ": " + (db != nullptr ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
+    damaged = IsDamage(rc);
     return nullptr;
   }
   sqlite3_busy_timeout(db, kBusyTimeoutMs);
@@ -187,7 +224,7 @@ std::unique_ptr<IndexWriter> IndexWriter::Open(const std::string& dbDir, std::st
     // thinks, and all of it can be found again on disk.
     writer.reset();
     for (const char* suffix : {"", "-wal", "-shm"}) ::unlink((file + suffix).c_str());
-    return Open(dbDir, error);
+    return OpenFile(dbDir, error, damaged);
   }
   const std::string pragmas = "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA foreign_keys=OFF;";
   if (!RegisterMatchingFunctions(db)) {
@@ -196,12 +233,14 @@ std::unique_ptr<IndexWriter> IndexWriter::Open(const std::string& dbDir, std::st
   }
   if (!writer->Exec(pragmas.c_str()) || !writer->Exec(kSchema) || !writer->UpgradeLayout()) {
     error = file + ": " + writer->LastError();
+    damaged = writer->IsDamaged();
     return nullptr;
   }
   Statement* version = writer->Prepare("INSERT OR IGNORE INTO meta(key, value) VALUES ('schema', ?)");
   if (version == nullptr || version->Bind(std::to_string(kSchemaVersion)).Step() != SQLITE_DONE ||
       !writer->KeepFoldedNamesInStep()) {
     error = file + ": " + writer->LastError();
+    damaged = writer->IsDamaged();
     return nullptr;
   }
   return writer;

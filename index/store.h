@@ -110,6 +110,8 @@ class Database {
   Database(const Database&) = delete;
   Database& operator=(const Database&) = delete;
   const std::string& LastError() const { return m_error; }
+  // Whether the last failure found the file damaged: not a database, or corrupt pages.
+  bool IsDamaged() const { return m_damaged; }
 
  protected:
   explicit Database(sqlite3* db) : m_db(db) {}
@@ -122,14 +124,21 @@ class Database {
 
   sqlite3* m_db;
   std::string m_error;
+  bool m_damaged = false;
   std::map<const char*, std::unique_ptr<Statement>> m_statements;
 };
 
 class IndexWriter : public Database {
  public:
   // Opens (creating when needed) the index in dbDir; the directory is made private to
-  // its owner. Null with error set on failure.
+  // its owner. A damaged index is set aside and a new one started (see SetAside and
+  // SetAsideNote). Null with error set on failure.
   static std::unique_ptr<IndexWriter> Open(const std::string& dbDir, std::string& error);
+  // Moves the index of dbDir out of the way (as "index.sqlite3.damaged", replacing an
+  // earlier one, with its write-ahead log), for a new one to be built from the disk.
+  static bool SetAside(const std::string& dbDir, std::string& error);
+  // When Open set a damaged index aside: what was wrong with it and where it is kept.
+  const std::string& SetAsideNote() const { return m_setAsideNote; }
 
   bool Begin();
   bool Commit();
@@ -173,7 +182,10 @@ class IndexWriter : public Database {
   // Rebuilds the folded-name index when it was built with another folding.
   bool KeepFoldedNamesInStep();
 
+  static std::unique_ptr<IndexWriter> OpenFile(const std::string& dbDir, std::string& error, bool& damaged);
+
   std::int64_t m_textBytes = -1;  // text kept in all; -1 until first needed
+  std::string m_setAsideNote;
 };
 
 struct Query {

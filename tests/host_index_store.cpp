@@ -9,6 +9,7 @@
 #include <cctype>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <set>
 
 namespace fs = std::filesystem;
@@ -263,6 +264,30 @@ TEST_F(IndexStoreTest, FoldedNamesAreRebuiltForAnotherFolding) {
   writer_ = IndexWriter::Open(dir_ + "/db", error);
   ASSERT_TRUE(writer_) << error;
   EXPECT_EQ(prefixed(), 1);
+}
+
+// A file that is not an index (damaged, or overwritten) is kept aside and a new index
+// started, which the writer says.
+TEST_F(IndexStoreTest, DamagedIndexIsSetAsideAndStartedAgain) {
+  Put("docs", "a.txt");
+  writer_.reset();
+  const std::string file = dir_ + "/db/index.sqlite3";
+  const std::string garbage(8192, 'x');
+  std::ofstream(file, std::ios::binary | std::ios::trunc) << garbage;
+  std::string error;
+  writer_ = IndexWriter::Open(dir_ + "/db", error);
+  ASSERT_TRUE(writer_) << error;
+  EXPECT_NE(writer_->SetAsideNote().find("not a database"), std::string::npos) << writer_->SetAsideNote();
+  EXPECT_TRUE(All().empty());
+  Put("docs", "b.txt");
+  EXPECT_EQ(All(), std::set<std::string>{"docs/b.txt"});
+  std::ifstream kept(file + ".damaged", std::ios::binary);
+  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(kept), {}), garbage);
+  writer_.reset();
+  writer_ = IndexWriter::Open(dir_ + "/db", error);  // a sound index is opened as it is
+  ASSERT_TRUE(writer_) << error;
+  EXPECT_TRUE(writer_->SetAsideNote().empty());
+  EXPECT_EQ(All(), std::set<std::string>{"docs/b.txt"});
 }
 
 }  // namespace

@@ -335,6 +335,16 @@ TEST_F(ServiceTest, IndexEqualsDiskAfterRepeatedKillsUnderChanges) {
   EXPECT_GE(killedWhileConsuming, 4);
   auto wanted = [](const std::string& ext) { return ext != ".mp3" && ext != ".mkv"; };
   EXPECT_EQ(IndexPaths("photo"), DiskPaths("photo", "stress", wanted));
+
+  // An index found damaged at a start is set aside and the share indexed again.
+  pid_t pid = DaemonPid("fileindexd");
+  ASSERT_EQ(::kill(pid, SIGTERM), 0);  // a clean stop folds the write-ahead log in
+  ASSERT_EQ(::waitpid(pid, nullptr, 0), pid);
+  ASSERT_FALSE(fs::exists(Database("photo") + "-wal"));
+  WriteFile(Database("photo"), std::string(8192, 'x'));
+  ASSERT_EQ(StartHook("fileindexd"), 0) << Log();
+  EXPECT_TRUE(WaitUntil([&] { return IndexPaths("photo") == DiskPaths("photo", "stress", wanted); }));
+  EXPECT_NE(Log().find("share photo: its index was damaged"), std::string::npos) << Log();
 }
 
 // Malformed, truncated and oversized lines are logged and skipped; the good lines around

@@ -125,10 +125,32 @@ void IndexingService::OpenIndexer(const std::string& name, Share& share, const S
     share.retryAt = Clock::now() + kRetryAfterFailure;
     return;
   }
+  const std::string& note = share.indexer->Store().SetAsideNote();
+  if (!note.empty())
+    Log(LOG_ERR, "share %s: its index was damaged (%s); indexing it again", name.c_str(), note.c_str());
   if (!share.indexer->Configure(config)) {
     Log(LOG_ERR, "share %s: %s", name.c_str(), share.indexer->LastError().c_str());
+    if (RebuildIfDamaged(name, share)) return;
   }
   share.indexer->PollQueue();
+}
+
+bool IndexingService::RebuildIfDamaged(const std::string& name, Share& share) {
+  if (!share.indexer || !share.indexer->Store().IsDamaged()) return false;
+  const ShareConfig config = share.indexer->config();
+  m_extraction.Flush();
+  share.indexer.reset();
+  std::string error;
+  if (!fileindex_store::IndexWriter::SetAside(config.dbDirectory, error)) {
+    Log(LOG_ERR, "share %s: its index is damaged and cannot be set aside: %s", name.c_str(), error.c_str());
+    share.stop = Stop::kStoreFailed;
+    share.retryAt = Clock::now() + kRetryAfterFailure;
+    return true;
+  }
+  Log(LOG_ERR, "share %s: its index is damaged; it is kept as %s.damaged and the share is indexed again",
+      name.c_str(), fileindex_store::IndexFilePath(config.dbDirectory).c_str());
+  OpenIndexer(name, share, config);
+  return true;
 }
 
 void IndexingService::WatchQueueDirectory(Share& share, const std::string& queuePath) {
@@ -285,8 +307,9 @@ void IndexingService::RunSlice(milliseconds budget) {
   const ShareIndexer::SliceResult result = share.indexer->RunSlice(Clock::now() + budget);
   m_extraction.Wake();
   if (result == ShareIndexer::SliceResult::kStoreFailed) {
-    const std::string& error = share.indexer->LastError();
+    const std::string error = share.indexer->LastError();
     Log(LOG_ERR, "share %s: index write failed: %s", name.c_str(), error.c_str());
+    if (RebuildIfDamaged(name, share)) return;
     if (error.find("full") != std::string::npos) {
       share.nextSpaceCheck = Clock::time_point();
       if (!HasSpace(name, share)) return;

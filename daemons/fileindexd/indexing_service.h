@@ -53,6 +53,9 @@ class IndexingService {
   void WatchQueueDirectory(Share& share, const std::string& queuePath);
   bool HasSpace(const std::string& name, Share& share);
   void OpenIndexer(const std::string& name, Share& share, const ShareConfig& config);
+  // After a failed write: a damaged index is set aside and the share indexed again from
+  // the disk. False when the index is not damaged.
+  bool RebuildIfDamaged(const std::string& name, Share& share);
 
   fileindex_daemon::EventLoop& m_loop;
   std::map<std::string, Share> m_shares;
