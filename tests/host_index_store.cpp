@@ -40,13 +40,8 @@ class IndexStoreTest : public ::testing::Test {
     ASSERT_TRUE(writer_->Put(entry)) << writer_->LastError();
   }
   std::set<std::string> All() {
-    std::set<std::string> paths;
-    std::vector<Hit> hits;
-    Query query;
-    query.limit = 1000;
-    EXPECT_TRUE(Reader()->Search(query, hits));
-    for (const Hit& hit : hits) paths.insert(hit.path);
-    return paths;
+    const std::vector<std::string> paths = Find({}, true, Kind::kOther, 1000);
+    return std::set<std::string>(paths.begin(), paths.end());
   }
   std::vector<std::string> Find(const std::vector<std::string>& words, bool anyKind = true,
                                 Kind kind = Kind::kOther, std::size_t limit = 50) {
