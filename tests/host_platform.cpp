@@ -8,7 +8,6 @@
 #include <tavo/tavotifyd.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <climits>
 #include <csignal>
 #include <cstdlib>
