@@ -32,33 +32,17 @@ class IndexStoreTest : public ::testing::Test {
     fs::remove_all(dir_);
   }
   void Put(const std::string& parent, const std::string& name, std::int64_t mtime = 1, bool isDir = false) {
-    Entry entry;
-    entry.parent = parent;
-    entry.name = name;
-    entry.isDir = isDir;
-    entry.mtime = mtime;
-    entry.kind = isDir ? Kind::kOther : KindOfExtension(ExtensionOf(name));
-    entry.folder = "f";
-    ASSERT_TRUE(writer_->Put(entry)) << writer_->LastError();
+    const Kind kind = isDir ? Kind::kOther : KindOfExtension(ExtensionOf(name));
+    ASSERT_TRUE(writer_->Put(Entry{parent, name, isDir, 0, mtime, kind, "f"})) << writer_->LastError();
   }
   std::set<std::string> All() {
-    std::set<std::string> paths;
-    std::vector<Hit> hits;
-    Query query;
-    query.limit = 1000;
-    EXPECT_TRUE(Reader()->Search(query, hits));
-    for (const Hit& hit : hits) paths.insert(hit.path);
-    return paths;
+    const std::vector<std::string> paths = Find({}, true, Kind::kOther, 1000);
+    return std::set<std::string>(paths.begin(), paths.end());
   }
   std::vector<std::string> Find(const std::vector<std::string>& words, bool anyKind = true,
                                 Kind kind = Kind::kOther, std::size_t limit = 50) {
-    Query query;
-    query.words = words;
-    query.anyKind = anyKind;
-    query.kind = kind;
-    query.limit = limit;
     std::vector<Hit> hits;
-    EXPECT_TRUE(Reader()->Search(query, hits));
+    EXPECT_TRUE(Reader()->Search(Query{words, anyKind, kind, limit}, hits));
     std::vector<std::string> paths;
     for (const Hit& hit : hits) paths.push_back(hit.path);
     return paths;

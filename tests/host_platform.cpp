@@ -8,7 +8,6 @@
 #include <tavo/tavotifyd.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <climits>
 #include <csignal>
 #include <cstdlib>
@@ -18,6 +17,8 @@
 #include <sstream>
 #include <string>
 #include <vector>
+
+#include "host_support.h"
 namespace fs = std::filesystem;
 
 namespace {
@@ -52,11 +53,7 @@ class HostPlatformTest : public ::testing::Test {
     std::ofstream(root_ + path + ".new") << text;
     fs::rename(root_ + path + ".new", root_ + path);
   }
-  std::string Read(const std::string& path) {
-    std::stringstream text;
-    text << std::ifstream(root_ + path).rdbuf();
-    return text.str();
-  }
+  std::string Read(const std::string& path) { return host_test::ReadFile(root_ + path); }
   // Share name and directory of a full path, or "!<platform error>".
   std::string ShareOf(const std::string& full) {
     char name[492] = {0}, dir[4096] = {0};

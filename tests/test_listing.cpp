@@ -144,29 +144,18 @@ TEST_F(ListingTest, SharedReadsMatchFolderByFolderReads) {
   }
   WriteFolders(rows);
   const Json::Value names = ParseJson(R"(["status","is_valid"])");
-  const std::string full = Rooted("/volume1"), queueS = full + "/s/@eaDir/TAVO@file_index_queue";
-  const std::string queueT = full + "/t/@eaDir/TAVO@file_index_queue";
-  ::mkdir((full + "/s/@eaDir").c_str(), 0755);
-  ::mkdir((full + "/t/@eaDir").c_str(), 0755);
+  const std::string full = Rooted("/volume1"), queueS = Queue("s"), queueT = Queue("t");
+  ::mkdir(EaDir("s").c_str(), 0755), ::mkdir(EaDir("t").c_str(), 0755);
   std::mt19937 rng(5);
   auto queue = [&](const std::string& share, int lines) {
     std::string text;
     for (int i = 0; i < lines; ++i) {
       const std::string path =
           full + "/" + share + "/d" + std::to_string(rng() % 12) + (rng() % 2 ? "/x" : "");
-      switch (rng() % 6) {
-        case 0:
-          text += "{\"event\":2,\"path\":\"" + path + "\"} x\n";
-          break;  // malformed
-        case 1:
-          text += "{\"event\":256,\"path\":\"/o\",\"path_old\":\"" + path + "\"}\n";
-          break;
-        case 2:
-          text += "{\"event\":\"2\",\"path\":\"" + path + "\"}\n";
-          break;  // malformed
-        default:
-          text += "{\"event\":2,\"path\":\"" + path + "\"}\n";
-      }
+      const unsigned kind = rng() % 6;  // 0 and 2 are malformed
+      text += kind == 1   ? "{\"event\":256,\"path\":\"/o\",\"path_old\":\"" + path + "\"}\n"
+              : kind == 2 ? "{\"event\":\"2\",\"path\":\"" + path + "\"}\n"
+                          : "{\"event\":2,\"path\":\"" + path + (kind == 0 ? "\"} x\n" : "\"}\n");
     }
     return text;
   };

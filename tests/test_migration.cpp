@@ -2,8 +2,10 @@
 // into line with an existing folder.conf.
 #include <fileindex/utils.h>
 #include <sys/stat.h>
+
 #include <string>
 #include <vector>
+
 #include "support/sysroot_test.h"
 
 using namespace TAVO::FILEINDEX;
@@ -14,10 +16,9 @@ class MigrationTest : public SysrootTest {
  protected:
   void WriteFolders(const Strings& paths) {
     Json::Value conf(Json::objectValue);
-    for (const std::string& path : paths) conf[path]["name"] = path, ::mkdir(Rooted("/volume1" + path).c_str(), 0755);
+    for (const std::string& path : paths) conf[path]["name"] = path, ::mkdir(Full(path).c_str(), 0755);
     WriteFile(FolderConfPath(), conf.toStyledString());
   }
-  std::string Queue(const std::string& share) const { return Rooted("/volume1/" + share + "/@eaDir/TAVO@file_index_queue"); }
   static Strings ServiceCalls() {  // the platform calls that change the services, in order
     Strings out;
     for (const std::string& call : fake::Get().calls)
@@ -73,7 +74,7 @@ TEST_F(MigrationTest, StopsAtTheFirstFailingStep) {
   EXPECT_FALSE(Exists(Queue("photo")));
   fake::Reset();
   AddShare("photo");
-  ::mkdir(Rooted("/volume1/photo/@eaDir").c_str(), 0755);
+  ::mkdir(EaDir("photo").c_str(), 0755);
   ASSERT_EQ(::mkdir(Queue("photo").c_str(), 0755), 0);  // the queue cannot be written
   EXPECT_FALSE(Updater_vem60_beta2());
   EXPECT_EQ(fake::Get().monitorCalls.size(), 1u);

@@ -18,6 +18,13 @@ using internal::QueueLineKind;
 
 namespace {
 
+// The items of a '|'-separated list.
+std::vector<std::string> Split(const std::string& list) {
+  std::vector<std::string> items(1);
+  for (char c : list) c == '|' ? items.emplace_back() : items.back() += c;
+  return items;
+}
+
 // Random queue lines around one folder: escapes, surrogates, raw bytes, loose numbers, look-alike
 // keys, nesting, plus byte-level damage. Choice lists are '|'-separated.
 class LineGen {
@@ -51,8 +58,7 @@ class LineGen {
  private:
   size_t Pick(size_t n) { return static_cast<size_t>(rng_() % n); }
   std::string OneOf(const std::string& list) {
-    std::vector<std::string> items(1);
-    for (char c : list) c == '|' ? items.emplace_back() : items.back() += c;
+    const std::vector<std::string> items = Split(list);
     return items[Pick(items.size())];
   }
   std::string Path() {
@@ -99,12 +105,14 @@ QueueLineKind ExpectSameReading(const std::string& line, size_t* valid = nullptr
   return kind;
 }
 
-// Common shapes decided fast and right, common breakage refused, parser quirks left to the parser.
+// Common shapes decided fast and right, common breakage refused, parser quirks left to the parser;
+// then seeds with every one-byte deletion and delimiter insertion, and generated lines.
 TEST(QueueLineDifferential, HandPickedAndGeneratedLinesReadAsTheParserReadsThem) {
   const std::pair<QueueLineKind, std::vector<std::string>> table[] = {
       {QueueLineKind::kEvent,
        {R"({"event":256,"path":"/v/q","path_old":"/v/p/a"})",
-        R"({"event":4294967295,"path":"","path_old":7})", "{\"event\":2,\"path\":\"/a\0b\"}"s,
+        R"({"event":4294967295,"path":"","path_old":7})",
+        R"({"event":2,"path":"/a","path_old":"/b","path_old":[]})", "{\"event\":2,\"path\":\"/a\0b\"}"s,
         "{\"event\":2,\"path\":\"/a\tb\x01\x7f\xc3\xa9\xff\\u0000\\ud800\\u0041\"}\r",
         R"( {"path":"/x","event":"x","data":{"path":"/y"},"path":"/b" , "event":3} )",
         R"({"event":2,"path":"\/v\/\"q\"/\\/\b\f\n\r\t\u00e9\ud83d\ude00\udc00"})",
@@ -119,6 +127,25 @@ TEST(QueueLineDifferential, HandPickedAndGeneratedLinesReadAsTheParserReadsThem)
   for (const auto& group : table)
     for (const std::string& line : group.second)
       EXPECT_EQ(ExpectSameReading(line), group.first) << ::testing::PrintToString(line);
+  const std::vector<std::string> seeds{
+      R"({"event":2,"path":"/v/p/a","data":{}})",
+      R"( {"path" : "/v/p", "event" : 256 , "path_old":"/v/q/b", "data":[1,-2,true,null,"s\n\"\u00e9"]} )",
+      R"({"event":4294967295,"path":"","path_old":7})",
+      R"({"event":01,"path":"/a","data":"\ud800"})",
+      R"({"path":"/x","event":1,"data":{"path":"/y"},"path":"/b","event":3})",
+      R"({"event":256,"path":"/v/p/b","path_old":"/v/q/c"})",
+      R"({"event":4294967296,"path":"/v/p","data":{"inode":12,"size":0,"mtime":-1,"x":[1.5]}})",
+      R"({"event":8,"path":"/v/\u0070","path_old":"/v/q\"","data":null})"};
+  int decided = 0;
+  for (const std::string& s : seeds) {
+    std::vector<std::string> lines{s};
+    for (size_t i = 0; i < s.size(); ++i) {
+      lines.push_back(s.substr(0, i) + s.substr(i + 1));
+      for (char c : std::string("\"{}[],:\\ 0-e")) lines.push_back(s.substr(0, i) + c + s.substr(i));
+    }
+    for (const std::string& line : lines) decided += ExpectSameReading(line) == QueueLineKind::kEvent;
+  }
+  EXPECT_GT(decided, 100);
   // Generated: both sides reached, and a good share decided fast, or the comparison proves little.
   size_t valid = 0, events = 0, refused = 0;
   const size_t kLines = 20000;
@@ -142,28 +169,12 @@ std::string CompactLine(std::mt19937_64& rng, const std::string& folder) {
                   "/a\"", "/\\"}) +
            "\"";
   };
-  const std::string data = oneOf({"null",
-                                  "true",
-                                  "false",
-                                  "nul",
-                                  "{}",
-                                  R"({"inode":1,"size":-0,"mtime":123456789012345})",
-                                  R"({"a":01})",
-                                  R"({"a":1e5})",
-                                  R"({"a":1.0})",
-                                  R"({"a":1234567890123456})",
-                                  R"({"a":-})",
-                                  R"({"a":"s","b":true,"c":null,"d":false})",
-                                  R"({"a":"\""})",
-                                  R"({"a":[1]})",
-                                  R"({"a":{}})",
-                                  R"({"a":1,})",
-                                  R"({"a" :1})",
-                                  R"({"a":truex})",
-                                  R"({"path":"/x","event":1})",
-                                  R"({"a\u0062":1})",
-                                  R"({"":"")",
-                                  "{\"a\":\"" + std::string(rng() % 600, 'd') + "\"}"});
+  std::vector<std::string> datas = Split(
+      R"(null|true|false|nul|{}|{"inode":1,"size":-0,"mtime":123456789012345}|{"a":01}|{"a":1e5}|{"a":1.0}|)"
+      R"({"a":1234567890123456}|{"a":-}|{"a":"s","b":true,"c":null,"d":false}|{"a":"\""}|{"a":[1]}|{"a":{}}|)"
+      R"({"a":1,}|{"a" :1}|{"a":truex}|{"path":"/x","event":1}|{"a\u0062":1}|{"":"")");
+  datas.push_back("{\"a\":\"" + std::string(rng() % 600, 'd') + "\"}");
+  const std::string data = oneOf(datas);
   std::string line = "{\"event\":" +
                      oneOf({"2", "256", "65536", "0", "4294967295", "4294967296", "12345678901", "01", "-1",
                             "1.5", "2e1", "9"}) +

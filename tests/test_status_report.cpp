@@ -1,4 +1,4 @@
-// The overall and per-folder status words, and the queue line reading they rest on.
+// The overall and per-folder status words.
 #include <fileindex/status_mgr.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -6,8 +6,6 @@
 #include <string>
 #include <vector>
 
-#include "internal/queue_line_view.h"
-#include "internal/queue_scan.h"
 #include "support/sysroot_test.h"
 
 using namespace TAVO::FILEINDEX;
@@ -23,11 +21,10 @@ class StatusReportTest : public SysrootTest {
     fake::SetClock(kNow);
     AddShare("photo");
     ::mkdir(Full("/photo/2019").c_str(), 0755);
-    ::mkdir(Full("/photo/@eaDir").c_str(), 0755);
+    ::mkdir(EaDir("photo").c_str(), 0755);
     WriteFile(FolderConfPath(), R"({"/photo/2019":{"name":"y"}})");
-    queue_ = Full("/photo/@eaDir/TAVO@file_index_queue");
+    queue_ = Queue("photo");
   }
-  std::string Full(const std::string& p) const { return Rooted("/volume1" + p); }
   void SetResumeTime(const std::string& v) { WriteFile(StatusConfPath(), "{\"resume_time\":" + v + "}"); }
   static std::string Line(int event, const std::string& path) {
     return "{\"event\":" + std::to_string(event) + ",\"path\":\"" + path + "\",\"data\":{}}\n";
@@ -91,44 +88,4 @@ TEST_F(StatusReportTest, MalformedLinesAreLoggedAndTheWholeFileIsRead) {
   EXPECT_EQ(logcap::Texts(), (Lines{m + "nope", m + "{\"event\":2}", m, m + "{\"event\":2,\"path\":\"/x\""}));
   WriteFile(queue_, R"({"event":256,"path":"/x","path_old":")" + Full("/photo/2019") + R"(\u0041/c"})");
   EXPECT_EQ(Folder(), "finished");
-}
-
-// Wherever the one-pass reader decides a line, the full parser must read it the same way.
-TEST(QueueLineViewTest, AgreesWithTheFullParserWhereverItDecides) {
-  using namespace TAVO::FILEINDEX::internal;
-  const Lines seeds{
-      R"({"event":2,"path":"/v/p/a","data":{}})",
-      R"( {"path" : "/v/p", "event" : 256 , "path_old":"/v/q/b", "data":[1,-2,true,null,"s\n\"\u00e9"]} )",
-      R"({"event":4294967295,"path":"","path_old":7})",
-      R"({"path":"/x","event":1,"data":{"path":"/y"},"path":"/b","event":3})",
-      R"({"event":01,"path":"/a","data":"\ud800"})",
-      // The daemon's own compact forms, which the reader takes in fewer steps.
-      R"({"event":256,"path":"/v/p/b","path_old":"/v/q/c"})",
-      R"({"event":4294967296,"path":"/v/p","data":{"inode":12,"size":0,"mtime":-1,"x":[1.5]}})",
-      R"({"event":8,"path":"/v/\u0070","path_old":"/v/q\"","data":null})"};
-  Lines lines = seeds;  // plus every one-byte deletion and delimiter insertion
-  for (const std::string& s : seeds)
-    for (size_t i = 0; i < s.size(); ++i) {
-      lines.push_back(s.substr(0, i) + s.substr(i + 1));
-      for (char c : std::string("\"{}[],:\\ 0-e")) lines.push_back(s.substr(0, i) + c + s.substr(i));
-    }
-  int decided = 0;
-  for (const std::string& line : lines) {
-    QueueEventView view;
-    if (!ViewQueueLine(line.data(), line.size(), view)) continue;
-    ++decided;
-    QueueEvent event;
-    bool parsed = false;  // a throw counts as a disagreement
-    try {
-      parsed = ParseQueueLine(line.data(), line.size(), event);
-    } catch (const std::exception&) {
-    }
-    ASSERT_TRUE(parsed) << line;
-    EXPECT_EQ(view.event, event.event) << line;
-    EXPECT_EQ(std::string(view.path, view.pathSize), event.path) << line;
-    EXPECT_EQ(view.pathOld ? std::string(view.pathOld, view.pathOldSize) : "(none)",
-              event.hasPathOld ? event.pathOld : "(none)")
-        << line;
-  }
-  EXPECT_GT(decided, 100);
 }

@@ -121,40 +121,10 @@ std::vector<Json::Value> FakeDaemon::Commands() {
   return out;
 }
 
-std::vector<Json::Value> FakeDaemon::CommandsOfType(const std::string& type) {
-  std::vector<Json::Value> out;
-  for (const Json::Value& command : Commands()) {
-    if (command["type"].asString() == type) out.push_back(command);
-  }
-  return out;
-}
-
 std::vector<std::string> FakeDaemon::RawFrames() {
   std::unique_lock<std::mutex> lock(mu_);
   SettleLocked(lock);
   std::vector<std::string> out;
   for (const auto& frame : frames_) out.push_back(frame.raw);
   return out;
-}
-
-std::vector<fileindex_frame::DecodedFrame> FakeDaemon::Frames() {
-  std::unique_lock<std::mutex> lock(mu_);
-  SettleLocked(lock);
-  return frames_;
-}
-
-void FakeDaemon::Clear() {
-  std::unique_lock<std::mutex> lock(mu_);
-  SettleLocked(lock);
-  frames_.clear();
-}
-
-bool FakeDaemon::WaitForCommands(std::size_t n, int timeoutMs) {
-  std::unique_lock<std::mutex> lock(mu_);
-  auto enough = [this, n] {
-    std::size_t ok = 0;
-    for (const auto& frame : frames_) ok += frame.ok ? 1 : 0;
-    return ok >= n;
-  };
-  return cv_.wait_for(lock, std::chrono::milliseconds(timeoutMs), enough);
 }

@@ -12,15 +12,12 @@
 //   ASSERT_TRUE(daemon.Start(SocketPath()));
 //   ASSERT_TRUE(SendCammandToDaemon("pause", data));
 //   ASSERT_EQ(daemon.Commands().size(), 1u);
-//
-// WaitForCommands(n, ms) is there for senders in other threads or processes.
 #ifndef FILEINDEX_TESTS_FAKE_DAEMON_H
 #define FILEINDEX_TESTS_FAKE_DAEMON_H
 
 #include <json/json.h>
 
 #include <condition_variable>
-#include <cstddef>
 #include <mutex>
 #include <string>
 #include <thread>
@@ -43,16 +40,8 @@ class FakeDaemon {
 
   // The decoded command objects, in arrival order; frames that did not decode are left out.
   std::vector<Json::Value> Commands();
-  // The commands whose "type" is type.
-  std::vector<Json::Value> CommandsOfType(const std::string& type);
   // Every connection's bytes as received (length prefix included), in arrival order.
   std::vector<std::string> RawFrames();
-  // Every connection decoded, the failures included.
-  std::vector<fileindex_frame::DecodedFrame> Frames();
-  // Forgets what was recorded.
-  void Clear();
-  // Waits until at least n commands were recorded; false on timeout.
-  bool WaitForCommands(std::size_t n, int timeoutMs);
 
   const std::string& SocketPath() const { return path_; }
 

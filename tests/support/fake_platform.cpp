@@ -1,17 +1,16 @@
 #include "support/fake_platform.h"
 
+#include <strings.h>
 #include <sys/stat.h>
 #include <tavo/platform.h>
 #include <tavo/tavotifyd.h>
-
-#include <strings.h>
 
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
-#include <stdexcept>
+#include <filesystem>
 
 namespace fake {
 
@@ -28,16 +27,6 @@ bool Record(const std::string& call, const char* function, int* forcedResult) {
   if (it == Get().forced.end()) return false;
   *forcedResult = it->second;
   return true;
-}
-
-void MakeDirs(const std::string& path) {
-  std::string partial;
-  size_t pos = 0;
-  while (pos != std::string::npos) {
-    pos = path.find('/', pos + 1);
-    partial = path.substr(0, pos);
-    if (!partial.empty()) ::mkdir(partial.c_str(), 0755);
-  }
 }
 
 bool Inside(const std::string& full, const std::string& dir) {
@@ -57,7 +46,7 @@ Share& AddShare(const std::string& root, const std::string& volume, const std::s
   Share share;
   share.name = name;
   share.dir = root + volume + "/" + name;
-  MakeDirs(share.dir);
+  std::filesystem::create_directories(share.dir);
   Get().shares[name] = share;
   return Get().shares[name];
 }
@@ -75,17 +64,19 @@ void SetClock(long long now) {
   g_clock = now;
 }
 
-void ClearClock() { g_clockSet = false; }
-
 }  // namespace fake
 
-// Records the call; a forced result for the function is returned at once.
-#define FAKE_RECORD(function, args)                                                     \
+// Records the call; a forced result for the function is returned at once, a negative one
+// with the platform error (code, file, line) set when code is not 0.
+#define FAKE_RECORD_ERR(function, args, code, file, line)                               \
   do {                                                                                  \
     int forced_;                                                                        \
-    if (fake::Record(std::string(#function "(") + (args) + ")", #function, &forced_)) \
+    if (fake::Record(std::string(#function "(") + (args) + ")", #function, &forced_)) { \
+      if (forced_ < 0 && (code) != 0) VLIBCErrSetEx(code, file, line);                  \
       return forced_;                                                                   \
+    }                                                                                   \
   } while (0)
+#define FAKE_RECORD(function, args) FAKE_RECORD_ERR(function, args, 0, "", 0)
 
 extern "C" {
 
@@ -133,7 +124,8 @@ int TAVOShareNamePathGet(const char* szFullPath, char* szName, int cbName, char*
   FAKE_RECORD(TAVOShareNamePathGet, fake::Quote(szFullPath));
   const fake::Share* best = nullptr;
   for (const auto& entry : fake::Get().shares) {
-    if (fake::Inside(szFullPath, entry.second.dir) && (best == nullptr || entry.second.dir.size() > best->dir.size()))
+    if (fake::Inside(szFullPath, entry.second.dir) &&
+        (best == nullptr || entry.second.dir.size() > best->dir.size()))
       best = &entry.second;
   }
   if (best == nullptr) {
@@ -152,7 +144,8 @@ int TAVOShareIsShareRecycle(const char* szFullPath) {
 
 static int ShareFlag(const char* function, PTAVOSHARE share, int* out, bool value) {
   int forced;
-  if (fake::Record(std::string(function) + "(" + fake::Quote(share ? share->szName : nullptr) + ")", function, &forced))
+  if (fake::Record(std::string(function) + "(" + fake::Quote(share ? share->szName : nullptr) + ")", function,
+                   &forced))
     return forced;
   *out = value ? 1 : 0;
   return 0;
@@ -210,41 +203,26 @@ int TAVOEAMKDir(int flag, const char* szPath) {
 }
 
 int TAVOQuotaIsEnough(unsigned int uid, const char* szPath, unsigned long long cbSize) {
-  int forced;
-  if (fake::Record("TAVOQuotaIsEnough(" + std::to_string(uid) + "," + fake::Quote(szPath) + "," +
-                       std::to_string(cbSize) + ")",
-                   "TAVOQuotaIsEnough", &forced))
-    return forced;
+  FAKE_RECORD(TAVOQuotaIsEnough,
+              std::to_string(uid) + "," + fake::Quote(szPath) + "," + std::to_string(cbSize));
   if (fake::Get().quotaResult == 0) VLIBCErrSetEx(fake::Get().quotaError, "fake", 4);
   return fake::Get().quotaResult;
 }
 
 int VLIBServiceStart(const char* szService, int flag) {
-  int forced;
-  if (fake::Record("VLIBServiceStart(" + fake::Quote(szService) + "," + std::to_string(flag) + ")", "VLIBServiceStart",
-                   &forced)) {
-    if (forced < 0) VLIBCErrSetEx(0x3000, "service.c", 10);
-    return forced;
-  }
+  FAKE_RECORD_ERR(VLIBServiceStart, fake::Quote(szService) + "," + std::to_string(flag), 0x3000, "service.c",
+                  10);
   return 0;
 }
 
 int VLIBServiceStop(const char* szService, int flag) {
-  int forced;
-  if (fake::Record("VLIBServiceStop(" + fake::Quote(szService) + "," + std::to_string(flag) + ")", "VLIBServiceStop",
-                   &forced)) {
-    if (forced < 0) VLIBCErrSetEx(0x3001, "service.c", 20);
-    return forced;
-  }
+  FAKE_RECORD_ERR(VLIBServiceStop, fake::Quote(szService) + "," + std::to_string(flag), 0x3001, "service.c",
+                  20);
   return 0;
 }
 
 int VLIBServiceRestart(const char* szService) {
-  int forced;
-  if (fake::Record("VLIBServiceRestart(" + fake::Quote(szService) + ")", "VLIBServiceRestart", &forced)) {
-    if (forced < 0) VLIBCErrSetEx(0x3002, "service.c", 30);
-    return forced;
-  }
+  FAKE_RECORD_ERR(VLIBServiceRestart, fake::Quote(szService), 0x3002, "service.c", 30);
   return 0;
 }
 
@@ -254,11 +232,7 @@ int TAVOSMBIsEnableSpotlight(void) {
 }
 
 int TAVOSMBSetSpotlight(int blEnable) {
-  int forced;
-  if (fake::Record("TAVOSMBSetSpotlight(" + std::to_string(blEnable) + ")", "TAVOSMBSetSpotlight", &forced)) {
-    if (forced < 0) VLIBCErrSetEx(0x3100, "smb.c", 40);
-    return forced;
-  }
+  FAKE_RECORD_ERR(TAVOSMBSetSpotlight, std::to_string(blEnable), 0x3100, "smb.c", 40);
   fake::Get().spotlight = blEnable != 0;
   return 0;
 }
@@ -315,7 +289,6 @@ namespace TAVOTIFYD {
 
 MonitorQueue::MonitorQueue(const Json::Value& config) : m_config(config) {
   fake::Get().calls.push_back("MonitorQueue(" + config.toStyledString() + ")");
-  if (fake::Get().monitorThrows) throw std::runtime_error("fake MonitorQueue refuses");
 }
 MonitorQueue::~MonitorQueue() {}
 MonitorQueue::MonitorQueue(const MonitorQueue& other) : m_config(other.m_config) {}
@@ -326,23 +299,14 @@ MonitorQueue& MonitorQueue::operator=(const MonitorQueue& other) {
 const Json::Value& MonitorQueue::GetConfig() const { return m_config; }
 
 int MonitorQueue::Upsert(const MonitorQueue& queue, const std::string& name, _tag_monitor_queue_type_ type) {
-  fake::MonitorCall call;
-  call.op = "upsert";
-  call.name = name;
-  call.type = type;
-  call.config = queue.GetConfig();
-  fake::Get().monitorCalls.push_back(call);
+  fake::Get().monitorCalls.push_back({"upsert", name, type, queue.GetConfig(), ""});
   fake::Get().calls.push_back("MonitorQueue::Upsert(" + name + ")");
   return fake::Get().monitorUpsertResult;
 }
 
-int MonitorQueue::Delete(const std::string& queuePath, const std::string& name, _tag_monitor_queue_type_ type) {
-  fake::MonitorCall call;
-  call.op = "delete";
-  call.name = name;
-  call.type = type;
-  call.queuePath = queuePath;
-  fake::Get().monitorCalls.push_back(call);
+int MonitorQueue::Delete(const std::string& queuePath, const std::string& name,
+                         _tag_monitor_queue_type_ type) {
+  fake::Get().monitorCalls.push_back({"delete", name, type, Json::Value(), queuePath});
   fake::Get().calls.push_back("MonitorQueue::Delete(" + queuePath + ")");
   return fake::Get().monitorDeleteResult;
 }

@@ -56,7 +56,6 @@ struct Platform {
 
   // Notification daemon client.
   std::vector<MonitorCall> monitorCalls;
-  bool monitorThrows = false;
   int monitorUpsertResult = 1;
   int monitorDeleteResult = 1;
 
@@ -81,9 +80,8 @@ Share& AddShare(const std::string& root, const std::string& volume, const std::s
 // The recorded calls whose text starts with prefix.
 std::vector<std::string> CallsStartingWith(const std::string& prefix);
 
-// A controllable clock for time(): set, or cleared to use the real clock.
+// A controllable clock for time() until the next Reset(), which goes back to the real clock.
 void SetClock(long long now);
-void ClearClock();
 
 }  // namespace fake
 

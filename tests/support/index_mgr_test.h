@@ -24,10 +24,6 @@ class IndexMgrTest : public SysrootTest {
 
   void StartDaemon() { ASSERT_TRUE(daemon_.Start(SocketPath())); }
 
-  // Share path to full path, for shares made by AddShare on /volume1.
-  std::string Full(const std::string& path) const { return Rooted("/volume1") + path; }
-  std::string EaDir(const std::string& share) const { return Rooted("/volume1/") + share + "/@eaDir"; }
-  std::string Queue(const std::string& share) const { return EaDir(share) + "/TAVO@file_index_queue"; }
   std::string Db(const std::string& share) const { return EaDir(share) + "/TAVO@.fileindexdb"; }
   std::string LockPath() const { return Rooted("/tmp/fileidx_cfg_folder.lock"); }
 

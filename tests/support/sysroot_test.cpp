@@ -5,26 +5,17 @@
 #include <unistd.h>
 
 #include <cstdlib>
+#include <filesystem>
 #include <fstream>
 #include <sstream>
-
-namespace {
-void MakeDirs(const std::string& path) {
-  for (size_t pos = path.find('/', 1);; pos = path.find('/', pos + 1)) {
-    ::mkdir(path.substr(0, pos).c_str(), 0755);
-    if (pos == std::string::npos) break;
-  }
-}
-}  // namespace
 
 void SysrootTest::SetUp() {
   char tmpl[] = "/tmp/fileindex-test-XXXXXX";
   ASSERT_NE(::mkdtemp(tmpl), nullptr);
   root_ = tmpl;
   ::setenv("FILEINDEX_SYSROOT", root_.c_str(), 1);
-  MakeDirs(root_ + "/usr/tavo/etc/fileindex");
-  MakeDirs(root_ + "/tmp");
-  MakeDirs(root_ + "/var/run");
+  for (const char* dir : {"/usr/tavo/etc/fileindex", "/tmp", "/var/run"})
+    std::filesystem::create_directories(root_ + dir);
   fake::Reset();
   logcap::Clear();
   TAVO::FILEINDEX::LOG_LEVEL = 3;
@@ -66,7 +57,8 @@ Json::Value SysrootTest::ParseJson(const std::string& text) {
   std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value value;
   std::string errors;
-  EXPECT_TRUE(reader->parse(text.data(), text.data() + text.size(), &value, &errors)) << text << ": " << errors;
+  EXPECT_TRUE(reader->parse(text.data(), text.data() + text.size(), &value, &errors))
+      << text << ": " << errors;
   return value;
 }
 

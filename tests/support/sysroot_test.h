@@ -23,6 +23,10 @@ class SysrootTest : public ::testing::Test {
   std::string FolderConfPath() const { return Rooted("/usr/tavo/etc/fileindex/folder.conf"); }
   std::string StatusConfPath() const { return Rooted("/usr/tavo/etc/fileindex/status.conf"); }
   std::string SocketPath() const { return Rooted("/var/run/fileindexd.sock"); }
+  // A share's full paths, for shares made by AddShare on /volume1.
+  std::string Full(const std::string& path) const { return Rooted("/volume1") + path; }
+  std::string EaDir(const std::string& share) const { return Rooted("/volume1/") + share + "/@eaDir"; }
+  std::string Queue(const std::string& share) const { return EaDir(share) + "/TAVO@file_index_queue"; }
 
   // Adds share name in <root><volume>/<name>.
   fake::Share& AddShare(const std::string& name, const std::string& volume = "/volume1");
