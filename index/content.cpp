@@ -10,7 +10,6 @@ namespace fileindex_store {
 
 namespace {
 
-
 // One row per extracted file, for the version (mtime, size) it was extracted from; the
 // text in a full-text table of its own whose rowid is the entry's id.
 const char kContentSchema[] =
@@ -101,11 +100,21 @@ int IndexWriter::LayoutVersion() {
 }
 
 // Layout 1 (entries and names only) gains the content tables; everything it held keeps
-// its meaning, and every file's content is then extracted afresh.
+// its meaning, and every file's content is then extracted afresh. In layout 2 an entry's
+// kind was always its name's; from layout 3 on it is the kind its content was found to be,
+// which layout 2 kept beside the content.
 bool IndexWriter::UpgradeLayout() {
-  if (LayoutVersion() == kLayoutVersion) return true;
-  const std::string upgrade = std::string("BEGIN IMMEDIATE;") + kContentSchema +
-                              "PRAGMA user_version=" + std::to_string(kLayoutVersion) + "; COMMIT;";
+  const int version = LayoutVersion();
+  if (version == kLayoutVersion) return true;
+  std::string upgrade = std::string("BEGIN IMMEDIATE;") + kContentSchema;
+  if (version == 2) {
+    upgrade +=
+        "UPDATE entries SET kind = (SELECT c.kind FROM contents c WHERE c.id = entries.id)"
+        " WHERE id IN (SELECT c.id FROM contents c JOIN entries e ON e.id = c.id"
+        "   WHERE c.state != 3 AND c.kind != 0 AND c.kind != e.kind AND c.mtime = e.mtime AND c.size = "
+        "e.size);";
+  }
+  upgrade += "PRAGMA user_version=" + std::to_string(kLayoutVersion) + "; COMMIT;";
   if (Exec(upgrade.c_str())) return true;
   Rollback();
   return false;
@@ -117,7 +126,7 @@ bool IndexWriter::PendingContent(std::int64_t afterId, std::size_t limit, std::v
   Statement* statement = Prepare(
       "SELECT e.id, e.parent, e.name, e.size, e.mtime, e.kind, e.folder FROM entries e"
       " LEFT JOIN contents c ON c.id = e.id"
-      " WHERE e.id > ?1 AND e.id <= ?1 + ?3 AND e.is_dir = 0 AND e.kind != 0"
+      " WHERE e.id > ?1 AND e.id <= ?1 + ?3 AND e.is_dir = 0"
       "   AND (c.id IS NULL OR c.mtime != e.mtime OR c.size != e.size)"
       " ORDER BY e.id LIMIT ?2");
   if (statement == nullptr) return false;
@@ -160,14 +169,41 @@ bool IndexWriter::DropContent(std::int64_t id) {
   return text->Bind(id).Step() == SQLITE_DONE || Fail("drop content");
 }
 
+bool IndexWriter::ForgetContent(const std::string& parent, const std::string& name) {
+  Statement* statement = Prepare("SELECT id FROM entries WHERE parent = ? AND name = ?");
+  if (statement == nullptr) return false;
+  int rc = statement->Bind(parent).Bind(name).Step();
+  if (rc == SQLITE_DONE) return true;
+  if (rc != SQLITE_ROW) return Fail("forget content");
+  return DropContent(statement->Int(0));
+}
+
+// Such a file is the only kind of skipped one whose content's kind is not its entry's: a
+// file's entry takes its content's kind, unless that kind is switched off.
+bool IndexWriter::ForgetKindSkipped(const std::string& folder, std::uint64_t& changed) {
+  Statement* statement = Prepare(
+      "DELETE FROM contents WHERE id IN (SELECT c.id FROM contents c JOIN entries e ON e.id = c.id"
+      " WHERE c.state = 3 AND c.kind != 0 AND c.kind != e.kind AND e.folder = ?)");
+  if (statement == nullptr) return false;
+  if (statement->Bind(folder).Step() != SQLITE_DONE) return Fail("forget skipped content");
+  changed = static_cast<std::uint64_t>(sqlite3_changes(m_db));
+  return true;
+}
+
 bool IndexWriter::PutContent(const ContentCandidate& candidate, const Content& content,
                              const std::string& text, bool& stored) {
   stored = false;
-  Statement* current = Prepare("SELECT 1 FROM entries WHERE id = ? AND mtime = ? AND size = ?");
+  Statement* current = Prepare("SELECT kind FROM entries WHERE id = ? AND mtime = ? AND size = ?");
   if (current == nullptr) return false;
   int rc = current->Bind(candidate.id).Bind(candidate.entry.mtime).Bind(candidate.entry.size).Step();
   if (rc == SQLITE_DONE) return true;  // changed or gone meanwhile: extracted again or never
   if (rc != SQLITE_ROW) return Fail("put content");
+  if (current->Int(0) != static_cast<std::int64_t>(candidate.entry.kind)) {
+    Statement* kind = Prepare("UPDATE entries SET kind = ? WHERE id = ?");
+    if (kind == nullptr) return false;
+    if (kind->Bind(static_cast<std::int64_t>(candidate.entry.kind)).Bind(candidate.id).Step() != SQLITE_DONE)
+      return Fail("put content");
+  }
   if (!DropContent(candidate.id)) return false;
 
   if (m_textBytes < 0) {

@@ -140,7 +140,7 @@ TEST_F(IndexStoreTest, ContentFollowsItsEntryAndLayoutsAreMigratedOrRebuilt) {
     // One look covers a window of ids: a long run without work takes a few looks.
     std::vector<ContentCandidate> none;
     ASSERT_TRUE(writer_->Begin());
-    for (int i = 0; i < 5000; ++i) Put("other", std::to_string(i) + ".bin");
+    for (int i = 0; i < 5000; ++i) Put("other", std::to_string(i), 1, true);
     Put("other", "last.txt");
     ASSERT_TRUE(writer_->Commit());
     std::int64_t after = pending.back().id;
@@ -213,6 +213,32 @@ TEST_F(IndexStoreTest, ContentFollowsItsEntryAndLayoutsAreMigratedOrRebuilt) {
   ASSERT_TRUE(writer_) << error;
   EXPECT_EQ(All(), std::set<std::string>{"docs/c.txt"});
   EXPECT_TRUE(ContentReader::Open(dir_ + "/db", error)) << error;
+
+  // The content's kind becomes the entry's (a PDF named as a photo is a document). The
+  // second layout kept it beside the content only; the writer moves it over.
+  Put("docs", "d.jpg");
+  pending.clear();
+  ASSERT_TRUE(writer_->PendingContent(0, 10, pending, next, atEnd));
+  ASSERT_EQ(pending.size(), 2u);
+  ContentCandidate photo = pending[1];
+  ASSERT_EQ(photo.entry.name, "d.jpg");
+  content.kind = photo.entry.kind = Kind::kDocument;
+  ASSERT_TRUE(writer_->PutContent(photo, content, "", stored));
+  auto kindOf = [&](const std::string& path) {
+    auto reader = ContentReader::Open(dir_ + "/db", error);
+    EXPECT_TRUE(reader) << error;
+    Entry found;
+    bool exists = false, has = false;
+    return reader && reader->Lookup(path, found, exists, content, has) && exists ? found.kind : Kind::kOther;
+  };
+  EXPECT_EQ(kindOf("docs/d.jpg"), Kind::kDocument);
+  writer_.reset();
+  setLayout("UPDATE entries SET kind = 4 WHERE name = 'd.jpg'; PRAGMA user_version=2;");
+  EXPECT_FALSE(ContentReader::Open(dir_ + "/db", error));
+  writer_ = IndexWriter::Open(dir_ + "/db", error);
+  ASSERT_TRUE(writer_) << error;
+  EXPECT_EQ(kindOf("docs/d.jpg"), Kind::kDocument);
+  EXPECT_EQ(kindOf("docs/c.txt"), Kind::kDocument);
 
   // A newer layout: nothing reads it; the writer starts it again from nothing.
   writer_.reset();
