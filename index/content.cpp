@@ -28,6 +28,8 @@ const char kContentColumns[] =
     " c.width, c.height, c.taken, c.make, c.model, c.latitude, c.longitude, c.codecs, c.author,"
     " c.text_bytes, c.text_truncated";
 
+const int kContentColumnCount = 21;
+
 // The columns of kContentColumns, read from `first` on.
 Content ContentFromRow(sqlite3_stmt* row, int first) {
   auto text = [row](int column) {
@@ -284,7 +286,10 @@ bool ContentReader::Search(const ContentQuery& query, std::vector<ContentHit>& h
   std::string sql =
       std::string("SELECT e.parent, e.name, e.is_dir, e.size, e.mtime, e.kind, e.folder, c.id, ") +
       kContentColumns +
-      " FROM entries e LEFT JOIN contents c ON c.id = e.id AND c.mtime = e.mtime AND c.size = e.size"
+      (query.text.empty() ? " FROM entries e"
+                          : ", snippet(texts, 0, char(2), char(3), '…', 10) FROM texts JOIN entries e ON"
+                            " e.id = texts.rowid") +
+      " LEFT JOIN contents c ON c.id = e.id AND c.mtime = e.mtime AND c.size = e.size"
       " WHERE (? OR (e.kind = ? AND e.is_dir = 0))";
   std::vector<std::string> texts;
   auto like = [&](const char* column, const std::string& value) {
@@ -299,7 +304,7 @@ bool ContentReader::Search(const ContentQuery& query, std::vector<ContentHit>& h
   }
   const std::string words = MatchExpression(query.text);
   if (!query.text.empty()) {
-    sql += " AND e.id IN (SELECT rowid FROM texts WHERE texts MATCH ?)";
+    sql += " AND texts MATCH ?";
     texts.push_back(words.empty() ? std::string("\"\"") : words);
   }
   like("c.title", query.title);
@@ -336,6 +341,7 @@ bool ContentReader::Search(const ContentQuery& query, std::vector<ContentHit>& h
     found.hit.folder = statement.Text(6);
     found.hasContent = statement.IsNull(7) == false;
     if (found.hasContent) found.content = ContentFromRow(statement.Raw(), 8);
+    if (!query.text.empty()) found.snippet = statement.Text(8 + kContentColumnCount);
     hits.push_back(std::move(found));
   }
   return rc == SQLITE_DONE || Fail("search");

@@ -68,10 +68,16 @@ struct ContentQuery {
   }
 };
 
+// In a snippet, each matching word of the text stands between these two characters (which
+// the stored text never holds), and a cut is marked by an ellipsis.
+constexpr char kSnippetOpen = '\x02';
+constexpr char kSnippetClose = '\x03';
+
 struct ContentHit {
   Hit hit;
   bool hasContent = false;
   Content content;
+  std::string snippet;  // a few words of the text around the matches, when text was searched
 };
 
 class ContentReader : public Database {

@@ -234,6 +234,13 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   EXPECT_EQ(Paths({"--text", "guillemot"}), std::set<std::string>{"/photo/mixed/papers/minutes.odt"});
   EXPECT_EQ(Paths({"--text", "kitti"}), std::set<std::string>{"/photo/mixed/papers/notes.txt"});
   EXPECT_TRUE(Paths({"--text", "puffin albatross"}).empty());
+  // Hits show the words around the match, marked.
+  const Json::Value snippet = RunJson({"search", "--text", "cormo"});
+  ASSERT_EQ(snippet["hits"].size(), 1u);
+  EXPECT_EQ(snippet["hits"][0]["snippet"],
+            "…for the albatross project the second page mentions a «cormorant»");
+  EXPECT_NE(Run({"search", "--text", "albatross"}).out.find("figures for the «albatross» project"),
+            std::string::npos);
   EXPECT_EQ(Search({"--title", "seabird"})["/photo/mixed/papers/report.pdf"]["text_bytes"].asInt() > 40,
             true);
   // The table shows the main fields.
