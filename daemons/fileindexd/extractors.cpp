@@ -174,7 +174,10 @@ void ExtractPhoto(const std::string& path, Content& content) {
         GpsCoordinate(exif, "Exif.GPSInfo.GPSLatitude", "Exif.GPSInfo.GPSLatitudeRef", content.latitude) &&
         GpsCoordinate(exif, "Exif.GPSInfo.GPSLongitude", "Exif.GPSInfo.GPSLongitudeRef", content.longitude);
   } catch (const Exiv2::AnyError& error) {
-    throw ExtractError(std::string("Exiv2: ") + error.what());
+    // Exiv2 names the file it was given, here a descriptor's name that means nothing later.
+    std::string message = error.what();
+    if (message.compare(0, path.size() + 2, path + ": ") == 0) message.erase(0, path.size() + 2);
+    throw ExtractError("Exiv2: " + message);
   }
 }
 
