@@ -11,11 +11,13 @@ namespace fileindex_store {
 namespace {
 
 // One row per extracted file, for the version (mtime, size) it was extracted from; the
-// text in a full-text table of its own whose rowid is the entry's id.
+// text in a full-text table of its own whose rowid is the entry's id. Types and reasons
+// repeat from file to file: a row holds the number of its text in content_strings.
 const char kContentSchema[] =
+    "CREATE TABLE IF NOT EXISTS content_strings(id INTEGER PRIMARY KEY, text TEXT NOT NULL UNIQUE);"
     "CREATE TABLE IF NOT EXISTS contents("
     "  id INTEGER PRIMARY KEY, mtime INTEGER NOT NULL, size INTEGER NOT NULL,"
-    "  state INTEGER NOT NULL, mime TEXT NOT NULL, kind INTEGER NOT NULL, reason TEXT NOT NULL,"
+    "  state INTEGER NOT NULL, mime INTEGER NOT NULL, kind INTEGER NOT NULL, reason INTEGER NOT NULL,"
     "  title TEXT, artist TEXT, album TEXT, genre TEXT, year INTEGER, duration_ms INTEGER,"
     "  width INTEGER, height INTEGER, taken TEXT, make TEXT, model TEXT,"
     "  latitude REAL, longitude REAL, codecs TEXT, author TEXT,"
@@ -24,7 +26,9 @@ const char kContentSchema[] =
     "CREATE VIRTUAL TABLE IF NOT EXISTS texts USING fts5(body, tokenize='unicode61 remove_diacritics 2');";
 
 const char kContentColumns[] =
-    "c.state, c.mime, c.kind, c.reason, c.title, c.artist, c.album, c.genre, c.year, c.duration_ms,"
+    "c.state, (SELECT text FROM content_strings WHERE id = c.mime), c.kind,"
+    " (SELECT text FROM content_strings WHERE id = c.reason), c.title, c.artist, c.album, c.genre, c.year, "
+    "c.duration_ms,"
     " c.width, c.height, c.taken, c.make, c.model, c.latitude, c.longitude, c.codecs, c.author,"
     " c.text_bytes, c.text_truncated";
 
@@ -108,13 +112,26 @@ int IndexWriter::LayoutVersion() {
 bool IndexWriter::UpgradeLayout() {
   const int version = LayoutVersion();
   if (version == kLayoutVersion) return true;
-  std::string upgrade = std::string("BEGIN IMMEDIATE;") + kContentSchema;
+  std::string upgrade = "BEGIN IMMEDIATE;";
   if (version == 2) {
     upgrade +=
         "UPDATE entries SET kind = (SELECT c.kind FROM contents c WHERE c.id = entries.id)"
-        " WHERE id IN (SELECT c.id FROM contents c JOIN entries e ON e.id = c.id"
-        "   WHERE c.state != 3 AND c.kind != 0 AND c.kind != e.kind AND c.mtime = e.mtime AND c.size = "
-        "e.size);";
+        " WHERE id IN (SELECT c.id FROM contents c JOIN entries e ON e.id = c.id WHERE c.state != 3"
+        " AND c.kind != 0 AND c.kind != e.kind AND c.mtime = e.mtime AND c.size = e.size);"
+        "ALTER TABLE contents RENAME TO contents_2;"
+        "DROP INDEX IF EXISTS contents_by_taken;";
+  }
+  upgrade += kContentSchema;
+  if (version == 2) {
+    upgrade +=
+        "INSERT OR IGNORE INTO content_strings(text) SELECT mime FROM contents_2 UNION SELECT reason"
+        " FROM contents_2;"
+        "INSERT INTO contents SELECT id, mtime, size, state,"
+        " (SELECT s.id FROM content_strings s WHERE s.text = o.mime), kind,"
+        " (SELECT s.id FROM content_strings s WHERE s.text = o.reason), title, artist, album, genre, year,"
+        " duration_ms, width, height, taken, make, model, latitude, longitude, codecs, author, text_bytes,"
+        " text_truncated FROM contents_2 o;"
+        "DROP TABLE contents_2;";
   }
   upgrade += "PRAGMA user_version=" + std::to_string(kLayoutVersion) + "; COMMIT;";
   if (Exec(upgrade.c_str())) return true;
@@ -171,6 +188,25 @@ bool IndexWriter::DropContent(std::int64_t id) {
   return text->Bind(id).Step() == SQLITE_DONE || Fail("drop content");
 }
 
+bool IndexWriter::StringId(const std::string& text, std::int64_t& id) {
+  auto known = m_stringIds.find(text);
+  if (known != m_stringIds.end()) {
+    id = known->second;
+    return true;
+  }
+  Statement* statement = Prepare(
+      "INSERT INTO content_strings(text) VALUES (?) ON CONFLICT(text) DO UPDATE SET text = excluded.text"
+      " RETURNING id");
+  if (statement == nullptr) return false;
+  int rc = statement->Bind(text).Step();
+  if (rc != SQLITE_ROW) return Fail("put content");
+  id = statement->Int(0);
+  while (rc == SQLITE_ROW) rc = statement->Step();
+  if (rc != SQLITE_DONE) return Fail("put content");
+  m_stringIds.emplace(text, id);
+  return true;
+}
+
 bool IndexWriter::ForgetContent(const std::string& parent, const std::string& name) {
   Statement* statement = Prepare("SELECT id FROM entries WHERE parent = ? AND name = ?");
   if (statement == nullptr) return false;
@@ -219,6 +255,8 @@ bool IndexWriter::PutContent(const ContentCandidate& candidate, const Content& c
     truncated = truncated || keep > 0;
     keep = 0;
   }
+  std::int64_t mime = 0, reason = 0;
+  if (!StringId(content.mime, mime) || !StringId(content.reason, reason)) return false;
   Statement* insert = Prepare(
       "INSERT INTO contents(id, mtime, size, state, mime, kind, reason, title, artist, album, genre, year,"
       " duration_ms, width, height, taken, make, model, latitude, longitude, codecs, author, text_bytes,"
@@ -230,9 +268,9 @@ bool IndexWriter::PutContent(const ContentCandidate& candidate, const Content& c
       .Bind(candidate.entry.mtime)
       .Bind(candidate.entry.size)
       .Bind(static_cast<std::int64_t>(content.state))
-      .Bind(content.mime)
+      .Bind(mime)
       .Bind(static_cast<std::int64_t>(content.kind))
-      .Bind(content.reason)
+      .Bind(reason)
       .Bind(content.title)
       .Bind(content.artist)
       .Bind(content.album)

@@ -13,6 +13,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "search_condition.h"
@@ -178,7 +179,11 @@ class IndexWriter : public Database {
   // as current.
   bool UpgradeLayout();
 
-  std::int64_t m_textBytes = -1;  // text kept in all; -1 until first needed
+  // The number of a type's or reason's text in the index, added when new.
+  bool StringId(const std::string& text, std::int64_t& id);
+
+  std::int64_t m_textBytes = -1;                              // text kept in all; -1 until first needed
+  std::unordered_map<std::string, std::int64_t> m_stringIds;  // as committed or in this transaction
 };
 
 struct Query {
