@@ -27,8 +27,8 @@ const char kContentSchema[] =
 
 const char kContentColumns[] =
     "c.state, (SELECT text FROM content_strings WHERE id = c.mime), c.kind,"
-    " (SELECT text FROM content_strings WHERE id = c.reason), c.title, c.artist, c.album, c.genre, c.year, "
-    "c.duration_ms,"
+    " (SELECT text FROM content_strings WHERE id = c.reason),"
+    " c.title, c.artist, c.album, c.genre, c.year, c.duration_ms,"
     " c.width, c.height, c.taken, c.make, c.model, c.latitude, c.longitude, c.codecs, c.author,"
     " c.text_bytes, c.text_truncated";
 

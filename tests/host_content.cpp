@@ -153,6 +153,7 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   untitled.artist = "Night Heron";
   ASSERT_TRUE(cs::WriteAudio(top_ + "/music/take1.mp3", untitled));
   fs::rename(top_ + "/music/take1.mp3", top_ + "/music/take1");
+  cs::Write(top_ + "/empty", "");
   cs::Write(top_ + "/blob.bin", std::string(5000, '\x01') + "random");
   const std::vector<std::string> all{
       "photos/harbour.jpg", "photos/old.jpg",     "music/song.mp3",     "music/reed.flac",  "clip.mkv",
@@ -160,7 +161,7 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
       "photos/scan",        "photos/scan2.dat",   "papers/invoice.jpg", "music/take1"};
   ASSERT_NO_FATAL_FAILURE(AddFolder());
   ASSERT_TRUE(WaitExtracted(all));
-  ASSERT_TRUE(WaitExtracted({"blob.bin"}));
+  ASSERT_TRUE(WaitExtracted({"blob.bin", "empty"}));
   for (const std::string& name : all)
     EXPECT_EQ(Why("/photo/mixed/" + name)["content"]["state"], "extracted") << name << Log();
   const std::map<std::string, std::string> decided{{"/photo/mixed/photos/scan", "photo"},
@@ -179,6 +180,7 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   EXPECT_TRUE(Kinds({"--kind", "photo", "invoice"}).empty());
   EXPECT_EQ(Paths({"--text", "shearwater"}), std::set<std::string>{"/photo/mixed/papers/invoice.jpg"});
   EXPECT_EQ(Why("/photo/mixed/blob.bin")["state"], "indexed") << Why("/photo/mixed/blob.bin");
+  EXPECT_EQ(Why("/photo/mixed/empty")["reason"], "indexed by its name (inode/x-empty)");
 
   // Why other files are not indexed.
   WriteFile(top_ + "/@eaDir/thumb.txt", "thumbnail\n");

@@ -237,6 +237,7 @@ void Extraction::Pump() {
       Result result{share, std::move(candidate), Content(), ""};
       result.content.mime = "inode/x-empty";
       result.content.kind = result.candidate.entry.kind;
+      if (result.content.kind == Kind::kOther) result.content.state = ExtractState::kSkipped;  // of no kind
       Record(std::move(result));
       // A few at a time: the loop has sockets and slices to serve.
       if (++inline_ >= kBatch) {
