@@ -830,7 +830,8 @@ bool MakeContentFiles(const std::string& label, const std::string& dir, std::siz
       tags.album = word();
       tags.title = word() + " " + word() + " " + word();
       tags.year = static_cast<unsigned>(1970 + i % 50);
-      ok = cs::WriteAudio(base + (i % 2 ? ".flac" : ".mp3"), tags, 1);
+      static const char* const kAudio[] = {".mp3", ".flac", ".ogg"};
+      ok = cs::WriteAudio(base + kAudio[i % 3], tags, 1);
     } else if (label == "video") {
       ok = cs::WriteVideo(base + ".mkv", word() + " " + word(), 10, 64, 48);
     } else if (label == "pdf") {

@@ -10,13 +10,14 @@ namespace fileindex_store {
 
 namespace {
 
-
 // One row per extracted file, for the version (mtime, size) it was extracted from; the
-// text in a full-text table of its own whose rowid is the entry's id.
+// text in a full-text table of its own whose rowid is the entry's id. Types and reasons
+// repeat from file to file: a row holds the number of its text in content_strings.
 const char kContentSchema[] =
+    "CREATE TABLE IF NOT EXISTS content_strings(id INTEGER PRIMARY KEY, text TEXT NOT NULL UNIQUE);"
     "CREATE TABLE IF NOT EXISTS contents("
     "  id INTEGER PRIMARY KEY, mtime INTEGER NOT NULL, size INTEGER NOT NULL,"
-    "  state INTEGER NOT NULL, mime TEXT NOT NULL, kind INTEGER NOT NULL, reason TEXT NOT NULL,"
+    "  state INTEGER NOT NULL, mime INTEGER NOT NULL, kind INTEGER NOT NULL, reason INTEGER NOT NULL,"
     "  title TEXT, artist TEXT, album TEXT, genre TEXT, year INTEGER, duration_ms INTEGER,"
     "  width INTEGER, height INTEGER, taken TEXT, make TEXT, model TEXT,"
     "  latitude REAL, longitude REAL, codecs TEXT, author TEXT,"
@@ -25,9 +26,13 @@ const char kContentSchema[] =
     "CREATE VIRTUAL TABLE IF NOT EXISTS texts USING fts5(body, tokenize='unicode61 remove_diacritics 2');";
 
 const char kContentColumns[] =
-    "c.state, c.mime, c.kind, c.reason, c.title, c.artist, c.album, c.genre, c.year, c.duration_ms,"
+    "c.state, (SELECT text FROM content_strings WHERE id = c.mime), c.kind,"
+    " (SELECT text FROM content_strings WHERE id = c.reason),"
+    " c.title, c.artist, c.album, c.genre, c.year, c.duration_ms,"
     " c.width, c.height, c.taken, c.make, c.model, c.latitude, c.longitude, c.codecs, c.author,"
     " c.text_bytes, c.text_truncated";
+
+const int kContentColumnCount = 21;
 
 // The columns of kContentColumns, read from `first` on.
 Content ContentFromRow(sqlite3_stmt* row, int first) {
@@ -101,11 +106,34 @@ int IndexWriter::LayoutVersion() {
 }
 
 // Layout 1 (entries and names only) gains the content tables; everything it held keeps
-// its meaning, and every file's content is then extracted afresh.
+// its meaning, and every file's content is then extracted afresh. In layout 2 an entry's
+// kind was always its name's; from layout 3 on it is the kind its content was found to be,
+// which layout 2 kept beside the content.
 bool IndexWriter::UpgradeLayout() {
-  if (LayoutVersion() == kLayoutVersion) return true;
-  const std::string upgrade = std::string("BEGIN IMMEDIATE;") + kContentSchema +
-                              "PRAGMA user_version=" + std::to_string(kLayoutVersion) + "; COMMIT;";
+  const int version = LayoutVersion();
+  if (version == kLayoutVersion) return true;
+  std::string upgrade = "BEGIN IMMEDIATE;";
+  if (version == 2) {
+    upgrade +=
+        "UPDATE entries SET kind = (SELECT c.kind FROM contents c WHERE c.id = entries.id)"
+        " WHERE id IN (SELECT c.id FROM contents c JOIN entries e ON e.id = c.id WHERE c.state != 3"
+        " AND c.kind != 0 AND c.kind != e.kind AND c.mtime = e.mtime AND c.size = e.size);"
+        "ALTER TABLE contents RENAME TO contents_2;"
+        "DROP INDEX IF EXISTS contents_by_taken;";
+  }
+  upgrade += kContentSchema;
+  if (version == 2) {
+    upgrade +=
+        "INSERT OR IGNORE INTO content_strings(text) SELECT mime FROM contents_2 UNION SELECT reason"
+        " FROM contents_2;"
+        "INSERT INTO contents SELECT id, mtime, size, state,"
+        " (SELECT s.id FROM content_strings s WHERE s.text = o.mime), kind,"
+        " (SELECT s.id FROM content_strings s WHERE s.text = o.reason), title, artist, album, genre, year,"
+        " duration_ms, width, height, taken, make, model, latitude, longitude, codecs, author, text_bytes,"
+        " text_truncated FROM contents_2 o;"
+        "DROP TABLE contents_2;";
+  }
+  upgrade += "PRAGMA user_version=" + std::to_string(kLayoutVersion) + "; COMMIT;";
   if (Exec(upgrade.c_str())) return true;
   Rollback();
   return false;
@@ -117,7 +145,7 @@ bool IndexWriter::PendingContent(std::int64_t afterId, std::size_t limit, std::v
   Statement* statement = Prepare(
       "SELECT e.id, e.parent, e.name, e.size, e.mtime, e.kind, e.folder FROM entries e"
       " LEFT JOIN contents c ON c.id = e.id"
-      " WHERE e.id > ?1 AND e.id <= ?1 + ?3 AND e.is_dir = 0 AND e.kind != 0"
+      " WHERE e.id > ?1 AND e.id <= ?1 + ?3 AND e.is_dir = 0"
       "   AND (c.id IS NULL OR c.mtime != e.mtime OR c.size != e.size)"
       " ORDER BY e.id LIMIT ?2");
   if (statement == nullptr) return false;
@@ -160,14 +188,60 @@ bool IndexWriter::DropContent(std::int64_t id) {
   return text->Bind(id).Step() == SQLITE_DONE || Fail("drop content");
 }
 
+bool IndexWriter::StringId(const std::string& text, std::int64_t& id) {
+  auto known = m_stringIds.find(text);
+  if (known != m_stringIds.end()) {
+    id = known->second;
+    return true;
+  }
+  Statement* statement = Prepare(
+      "INSERT INTO content_strings(text) VALUES (?) ON CONFLICT(text) DO UPDATE SET text = excluded.text"
+      " RETURNING id");
+  if (statement == nullptr) return false;
+  int rc = statement->Bind(text).Step();
+  if (rc != SQLITE_ROW) return Fail("put content");
+  id = statement->Int(0);
+  while (rc == SQLITE_ROW) rc = statement->Step();
+  if (rc != SQLITE_DONE) return Fail("put content");
+  m_stringIds.emplace(text, id);
+  return true;
+}
+
+bool IndexWriter::ForgetContent(const std::string& parent, const std::string& name) {
+  Statement* statement = Prepare("SELECT id FROM entries WHERE parent = ? AND name = ?");
+  if (statement == nullptr) return false;
+  int rc = statement->Bind(parent).Bind(name).Step();
+  if (rc == SQLITE_DONE) return true;
+  if (rc != SQLITE_ROW) return Fail("forget content");
+  return DropContent(statement->Int(0));
+}
+
+// Such a file is the only kind of skipped one whose content's kind is not its entry's: a
+// file's entry takes its content's kind, unless that kind is switched off.
+bool IndexWriter::ForgetKindSkipped(const std::string& folder, std::uint64_t& changed) {
+  Statement* statement = Prepare(
+      "DELETE FROM contents WHERE id IN (SELECT c.id FROM contents c JOIN entries e ON e.id = c.id"
+      " WHERE c.state = 3 AND c.kind != 0 AND c.kind != e.kind AND e.folder = ?)");
+  if (statement == nullptr) return false;
+  if (statement->Bind(folder).Step() != SQLITE_DONE) return Fail("forget skipped content");
+  changed = static_cast<std::uint64_t>(sqlite3_changes(m_db));
+  return true;
+}
+
 bool IndexWriter::PutContent(const ContentCandidate& candidate, const Content& content,
                              const std::string& text, bool& stored) {
   stored = false;
-  Statement* current = Prepare("SELECT 1 FROM entries WHERE id = ? AND mtime = ? AND size = ?");
+  Statement* current = Prepare("SELECT kind FROM entries WHERE id = ? AND mtime = ? AND size = ?");
   if (current == nullptr) return false;
   int rc = current->Bind(candidate.id).Bind(candidate.entry.mtime).Bind(candidate.entry.size).Step();
   if (rc == SQLITE_DONE) return true;  // changed or gone meanwhile: extracted again or never
   if (rc != SQLITE_ROW) return Fail("put content");
+  if (current->Int(0) != static_cast<std::int64_t>(candidate.entry.kind)) {
+    Statement* kind = Prepare("UPDATE entries SET kind = ? WHERE id = ?");
+    if (kind == nullptr) return false;
+    if (kind->Bind(static_cast<std::int64_t>(candidate.entry.kind)).Bind(candidate.id).Step() != SQLITE_DONE)
+      return Fail("put content");
+  }
   if (!DropContent(candidate.id)) return false;
 
   if (m_textBytes < 0) {
@@ -181,6 +255,8 @@ bool IndexWriter::PutContent(const ContentCandidate& candidate, const Content& c
     truncated = truncated || keep > 0;
     keep = 0;
   }
+  std::int64_t mime = 0, reason = 0;
+  if (!StringId(content.mime, mime) || !StringId(content.reason, reason)) return false;
   Statement* insert = Prepare(
       "INSERT INTO contents(id, mtime, size, state, mime, kind, reason, title, artist, album, genre, year,"
       " duration_ms, width, height, taken, make, model, latitude, longitude, codecs, author, text_bytes,"
@@ -192,9 +268,9 @@ bool IndexWriter::PutContent(const ContentCandidate& candidate, const Content& c
       .Bind(candidate.entry.mtime)
       .Bind(candidate.entry.size)
       .Bind(static_cast<std::int64_t>(content.state))
-      .Bind(content.mime)
+      .Bind(mime)
       .Bind(static_cast<std::int64_t>(content.kind))
-      .Bind(content.reason)
+      .Bind(reason)
       .Bind(content.title)
       .Bind(content.artist)
       .Bind(content.album)
@@ -248,7 +324,10 @@ bool ContentReader::Search(const ContentQuery& query, std::vector<ContentHit>& h
   std::string sql =
       std::string("SELECT e.parent, e.name, e.is_dir, e.size, e.mtime, e.kind, e.folder, c.id, ") +
       kContentColumns +
-      " FROM entries e LEFT JOIN contents c ON c.id = e.id AND c.mtime = e.mtime AND c.size = e.size"
+      (query.text.empty() ? " FROM entries e"
+                          : ", snippet(texts, 0, char(2), char(3), '…', 10) FROM texts JOIN entries e ON"
+                            " e.id = texts.rowid") +
+      " LEFT JOIN contents c ON c.id = e.id AND c.mtime = e.mtime AND c.size = e.size"
       " WHERE (? OR (e.kind = ? AND e.is_dir = 0))";
   std::vector<std::string> texts;
   auto like = [&](const char* column, const std::string& value) {
@@ -263,7 +342,7 @@ bool ContentReader::Search(const ContentQuery& query, std::vector<ContentHit>& h
   }
   const std::string words = MatchExpression(query.text);
   if (!query.text.empty()) {
-    sql += " AND e.id IN (SELECT rowid FROM texts WHERE texts MATCH ?)";
+    sql += " AND texts MATCH ?";
     texts.push_back(words.empty() ? std::string("\"\"") : words);
   }
   like("c.title", query.title);
@@ -300,6 +379,7 @@ bool ContentReader::Search(const ContentQuery& query, std::vector<ContentHit>& h
     found.hit.folder = statement.Text(6);
     found.hasContent = statement.IsNull(7) == false;
     if (found.hasContent) found.content = ContentFromRow(statement.Raw(), 8);
+    if (!query.text.empty()) found.snippet = statement.Text(8 + kContentColumnCount);
     hits.push_back(std::move(found));
   }
   return rc == SQLITE_DONE || Fail("search");

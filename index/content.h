@@ -18,7 +18,7 @@ namespace fileindex_store {
 // The layout of the index file, as PRAGMA user_version. An index of an older layout is
 // migrated when the writer opens it; one of a newer layout is rebuilt. Readers refuse any
 // other layout rather than misread it.
-constexpr int kLayoutVersion = 2;
+constexpr int kLayoutVersion = 3;
 
 // At most this much text is kept per file, and per share in all.
 constexpr std::size_t kMaxTextPerFile = 1 << 20;
@@ -48,6 +48,7 @@ struct Content {
 };
 
 // A file whose content is still to be extracted (never done, or done for another version).
+// entry.kind is the kind its name suggests; PutContent stores there the kind decided.
 struct ContentCandidate {
   std::int64_t id = 0;
   Entry entry;
@@ -67,10 +68,16 @@ struct ContentQuery {
   }
 };
 
+// In a snippet, each matching word of the text stands between these two characters (which
+// the stored text never holds), and a cut is marked by an ellipsis.
+constexpr char kSnippetOpen = '\x02';
+constexpr char kSnippetClose = '\x03';
+
 struct ContentHit {
   Hit hit;
   bool hasContent = false;
   Content content;
+  std::string snippet;  // a few words of the text around the matches, when text was searched
 };
 
 class ContentReader : public Database {

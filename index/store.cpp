@@ -269,6 +269,7 @@ bool IndexWriter::Begin() { return Exec("BEGIN IMMEDIATE"); }
 bool IndexWriter::Commit() { return Exec("COMMIT"); }
 void IndexWriter::Rollback() {
   m_textBytes = -1;
+  m_stringIds.clear();  // some may have been added by what is undone
   if (!sqlite3_get_autocommit(m_db)) Exec("ROLLBACK");
 }
 

@@ -13,6 +13,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "search_condition.h"
@@ -166,10 +167,16 @@ class IndexWriter : public Database {
   bool PendingContent(std::int64_t afterId, std::size_t limit, std::vector<ContentCandidate>& out,
                       std::int64_t& scannedTo, bool& atEnd);
   // Stores a file's content when its entry is still the version extracted (stored false
-  // otherwise); text beyond the caps is dropped and marked truncated.
+  // otherwise), and candidate.entry.kind as the entry's kind; text beyond the caps is
+  // dropped and marked truncated.
   bool PutContent(const ContentCandidate& candidate, const Content& content, const std::string& text,
                   bool& stored);
   bool DropContent(std::int64_t id);
+  // The entry's content, if any, is forgotten: it is extracted again.
+  bool ForgetContent(const std::string& parent, const std::string& name);
+  // The files of folder kept by their names only because their content's kind was switched
+  // off are extracted again (after the folder's flags changed); changed counts them.
+  bool ForgetKindSkipped(const std::string& folder, std::uint64_t& changed);
 
  private:
   using Database::Database;
@@ -177,14 +184,19 @@ class IndexWriter : public Database {
   bool UnindexName(std::int64_t id, const std::string& name);
   // The layout version of an open index: 0 for none yet or the first layout.
   int LayoutVersion();
-  // Creates the content tables and marks the layout as current.
+  // Creates the content tables, or moves an older layout's data on, and marks the layout
+  // as current.
   bool UpgradeLayout();
   // Rebuilds the folded-name index when it was built with another folding.
   bool KeepFoldedNamesInStep();
 
   static std::unique_ptr<IndexWriter> OpenFile(const std::string& dbDir, std::string& error, bool& damaged);
 
-  std::int64_t m_textBytes = -1;  // text kept in all; -1 until first needed
+  // The number of a type's or reason's text in the index, added when new.
+  bool StringId(const std::string& text, std::int64_t& id);
+
+  std::int64_t m_textBytes = -1;                              // text kept in all; -1 until first needed
+  std::unordered_map<std::string, std::int64_t> m_stringIds;  // as committed or in this transaction
   std::string m_setAsideNote;
 };
 

@@ -5,12 +5,15 @@
 #define FILEINDEX_TESTS_CONTENT_SAMPLES_H
 
 #include <taglib/fileref.h>
+#include <taglib/opusfile.h>
 #include <taglib/tag.h>
 #include <zip.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <exiv2/exiv2.hpp>
 #include <fstream>
+#include <memory>
 #include <string>
 #include <utility>
 #include <vector>
@@ -129,11 +132,88 @@ inline std::string FlacHeader(double seconds) {
   return out + info;
 }
 
-// An MP3 or FLAC file (by its extension) with tags written by TagLib.
+// The Ogg page checksum: CRC-32 with polynomial 0x04C11DB7, most significant bit first, no
+// reflection, starting from 0, over the page with its checksum field zero.
+inline std::uint32_t OggCrc(const std::string& page) {
+  std::uint32_t crc = 0;
+  for (unsigned char byte : page) {
+    crc ^= static_cast<std::uint32_t>(byte) << 24;
+    for (int bit = 0; bit < 8; ++bit) crc = crc & 0x80000000u ? (crc << 1) ^ 0x04C11DB7u : crc << 1;
+  }
+  return crc;
+}
+
+inline void PutLe(std::string& out, std::uint64_t value, int bytes) {
+  for (int i = 0; i < bytes; ++i) out += static_cast<char>((value >> (8 * i)) & 0xFF);
+}
+
+// One Ogg page of the stream holding whole packets (at most 255 lacing values).
+inline std::string OggPage(int flags, std::uint64_t granule, std::uint32_t sequence,
+                           const std::vector<std::string>& packets) {
+  std::string lacing, body;
+  for (const std::string& packet : packets) {
+    for (std::size_t left = packet.size();; left -= 255) {
+      lacing += static_cast<char>(left < 255 ? left : 255);
+      if (left < 255) break;
+    }
+    body += packet;
+  }
+  std::string page = "OggS";
+  page += '\0';
+  page += static_cast<char>(flags);
+  PutLe(page, granule, 8);
+  PutLe(page, 0x0F1E2D3C, 4);  // the stream's serial number
+  PutLe(page, sequence, 4);
+  PutLe(page, 0, 4);  // the checksum, filled in below
+  page += static_cast<char>(lacing.size());
+  page += lacing + body;
+  const std::uint32_t crc = OggCrc(page);
+  for (int i = 0; i < 4; ++i) page[22 + i] = static_cast<char>((crc >> (8 * i)) & 0xFF);
+  return page;
+}
+
+// An Ogg Opus stream (mono, 48 kHz) of `seconds` of 20 ms packets, each an empty frame
+// (which a decoder plays as silence); its last page's granule position makes it exactly
+// that long. The tags are empty: TagLib writes them.
+inline std::string OggOpus(double seconds) {
+  const std::uint16_t preSkip = 312;
+  std::string head = "OpusHead";
+  head += '\1';  // version
+  head += '\1';  // channels
+  PutLe(head, preSkip, 2);
+  PutLe(head, 48000, 4);  // the input's sample rate
+  PutLe(head, 0, 2);      // output gain
+  head += '\0';           // channel mapping family
+  std::string tags = "OpusTags";
+  PutLe(tags, 6, 4);
+  tags += "sample";
+  PutLe(tags, 0, 4);  // no comments
+  std::string out = OggPage(0x02, 0, 0, {head}) + OggPage(0, 0, 1, {tags});
+  const std::uint64_t samples = static_cast<std::uint64_t>(seconds * 48000);
+  const std::uint64_t packets = (samples + 959) / 960;
+  const std::string packet(1, '\xF8');  // CELT fullband 20 ms, mono, one frame
+  std::uint32_t sequence = 2;
+  for (std::uint64_t sent = 0; sent < packets;) {
+    const std::uint64_t now = std::min<std::uint64_t>(255, packets - sent);
+    sent += now;
+    const bool last = sent == packets;
+    out += OggPage(last ? 0x04 : 0, preSkip + (last ? samples : sent * 960), sequence++,
+                   std::vector<std::string>(now, packet));
+  }
+  return out;
+}
+
+inline bool EndsWith(const std::string& text, const std::string& end) {
+  return text.size() >= end.size() && text.compare(text.size() - end.size(), end.size(), end) == 0;
+}
+
+// An MP3, FLAC or Ogg Opus (.ogg, .opus) file, by its extension, with tags written by TagLib.
 inline bool WriteAudio(const std::string& path, const Tags& tags, double seconds = 3) {
-  bool flac = path.size() > 5 && path.compare(path.size() - 5, 5, ".flac") == 0;
-  Write(path, flac ? FlacHeader(seconds) : Mp3Frames(seconds));
-  TagLib::FileRef file(path.c_str());
+  const bool opus = EndsWith(path, ".ogg") || EndsWith(path, ".opus");
+  Write(path, EndsWith(path, ".flac") ? FlacHeader(seconds) : opus ? OggOpus(seconds) : Mp3Frames(seconds));
+  std::unique_ptr<TagLib::File> opened;
+  if (opus) opened.reset(new TagLib::Ogg::Opus::File(path.c_str()));
+  TagLib::FileRef file = opened ? TagLib::FileRef(opened.release()) : TagLib::FileRef(path.c_str());
   if (file.isNull() || file.tag() == nullptr) return false;
   file.tag()->setTitle(TagLib::String(tags.title, TagLib::String::UTF8));
   file.tag()->setArtist(TagLib::String(tags.artist, TagLib::String::UTF8));

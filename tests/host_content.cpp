@@ -56,6 +56,14 @@ class ContentTest : public SandboxTest {
     for (const Json::Value& hit : result["hits"]) hits[hit["path"].asString()] = hit["content"];
     return hits;
   }
+  // share path -> kind of the hits of a search
+  std::map<std::string, std::string> Kinds(std::vector<std::string> args) {
+    args.insert(args.begin(), {"search", "--limit", "1000"});
+    std::map<std::string, std::string> kinds;
+    const Json::Value result = RunJson(args);
+    for (const Json::Value& hit : result["hits"]) kinds[hit["path"].asString()] = hit["kind"].asString();
+    return kinds;
+  }
   std::set<std::string> Paths(const std::vector<std::string>& args) {
     std::set<std::string> paths;
     for (const auto& hit : Search(args)) paths.insert(hit.first);
@@ -83,13 +91,15 @@ class ContentTest : public SandboxTest {
     if (done) return ::testing::AssertionSuccess();
     return ::testing::AssertionFailure() << "still pending: " << last << "\ndaemon log:\n" << Log();
   }
+  // Files of a kind whose contents are extracted.
   int ContentRows(int kind) {
     sqlite3* db = nullptr;
     int count = -1;
     if (sqlite3_open_v2((root_ + "/volume1/photo/@eaDir/TAVO@.fileindexdb/index.sqlite3").c_str(), &db,
                         SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
       sqlite3_stmt* statement = nullptr;
-      sqlite3_prepare_v2(db, "SELECT count(*) FROM contents WHERE kind = ?", -1, &statement, nullptr);
+      sqlite3_prepare_v2(db, "SELECT count(*) FROM contents WHERE kind = ? AND state = 1", -1, &statement,
+                         nullptr);
       sqlite3_bind_int(statement, 1, kind);
       if (sqlite3_step(statement) == SQLITE_ROW) count = sqlite3_column_int(statement, 0);
       sqlite3_finalize(statement);
@@ -124,13 +134,53 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   ASSERT_TRUE(cs::WriteDocx(top_ + "/papers/letter.docx", {"Dear committee,", "the puffin survey is done."}));
   ASSERT_TRUE(cs::WriteOdt(top_ + "/papers/minutes.odt", {"Minutes of the guillemot meeting"}));
   WriteFile(top_ + "/papers/notes.txt", "remember the kittiwake\n");
-  const std::vector<std::string> all{"photos/harbour.jpg", "photos/old.jpg",     "music/song.mp3",
-                                     "music/reed.flac",    "clip.mkv",           "papers/report.pdf",
-                                     "papers/letter.docx", "papers/minutes.odt", "papers/notes.txt"};
+  cs::Tags tide;
+  tide.title = "Slack Water";
+  tide.artist = "Turnstone";
+  tide.album = "Ebb";
+  tide.genre = "Ambient";
+  tide.year = 1999;
+  ASSERT_TRUE(cs::WriteAudio(top_ + "/music/tide.opus", tide, 7.5));
+  // The content decides the kind; the name is a hint only.
+  cs::Exif heron;
+  heron.make = "Heron";
+  heron.model = "H1";
+  heron.taken = "2012:03:04 05:06:07";
+  ASSERT_TRUE(cs::WritePhoto(top_ + "/photos/scan", heron));
+  ASSERT_TRUE(cs::WritePhoto(top_ + "/photos/scan2.dat", heron));
+  cs::Write(top_ + "/papers/invoice.jpg", cs::Pdf({"the invoice for the shearwater"}));
+  cs::Tags untitled;
+  untitled.artist = "Night Heron";
+  ASSERT_TRUE(cs::WriteAudio(top_ + "/music/take1.mp3", untitled));
+  fs::rename(top_ + "/music/take1.mp3", top_ + "/music/take1");
+  cs::Write(top_ + "/empty", "");
+  cs::Write(top_ + "/blob.bin", std::string(5000, '\x01') + "random");
+  const std::vector<std::string> all{
+      "photos/harbour.jpg", "photos/old.jpg",     "music/song.mp3",     "music/reed.flac",  "clip.mkv",
+      "papers/report.pdf",  "papers/letter.docx", "papers/minutes.odt", "papers/notes.txt", "music/tide.opus",
+      "photos/scan",        "photos/scan2.dat",   "papers/invoice.jpg", "music/take1"};
   ASSERT_NO_FATAL_FAILURE(AddFolder());
   ASSERT_TRUE(WaitExtracted(all));
+  ASSERT_TRUE(WaitExtracted({"blob.bin", "empty"}));
   for (const std::string& name : all)
     EXPECT_EQ(Why("/photo/mixed/" + name)["content"]["state"], "extracted") << name << Log();
+  const std::map<std::string, std::string> decided{{"/photo/mixed/photos/scan", "photo"},
+                                                   {"/photo/mixed/photos/scan2.dat", "photo"},
+                                                   {"/photo/mixed/papers/invoice.jpg", "document"},
+                                                   {"/photo/mixed/music/take1", "audio"},
+                                                   {"/photo/mixed/blob.bin", "other"}};
+  for (const auto& file : decided) {
+    std::string name = file.first.substr(file.first.rfind('/') + 1);
+    EXPECT_EQ(Kinds({name.substr(0, name.find('.'))})[file.first], file.second) << file.first;
+  }
+  EXPECT_EQ(Kinds({"--camera", "heron"}),
+            (std::map<std::string, std::string>{{"/photo/mixed/photos/scan", "photo"},
+                                                {"/photo/mixed/photos/scan2.dat", "photo"}}));
+  EXPECT_EQ(Kinds({"--kind", "document", "invoice"}).size(), 1u);
+  EXPECT_TRUE(Kinds({"--kind", "photo", "invoice"}).empty());
+  EXPECT_EQ(Paths({"--text", "shearwater"}), std::set<std::string>{"/photo/mixed/papers/invoice.jpg"});
+  EXPECT_EQ(Why("/photo/mixed/blob.bin")["state"], "indexed") << Why("/photo/mixed/blob.bin");
+  EXPECT_EQ(Why("/photo/mixed/empty")["reason"], "indexed by its name (inode/x-empty)");
 
   // Why other files are not indexed.
   WriteFile(top_ + "/@eaDir/thumb.txt", "thumbnail\n");
@@ -151,6 +201,15 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   EXPECT_NEAR(song["duration_ms"].asDouble(), 3000, 200);
   EXPECT_EQ(song["mime"], "audio/mpeg");
   EXPECT_EQ(Paths({"--album", "REEDS"}), std::set<std::string>{"/photo/mixed/music/reed.flac"});
+  auto ogg = Search({"--artist", "turnstone"});
+  ASSERT_EQ(ogg.size(), 1u);
+  const Json::Value& opus = ogg["/photo/mixed/music/tide.opus"];
+  EXPECT_EQ(opus["title"], "Slack Water");
+  EXPECT_EQ(opus["album"], "Ebb");
+  EXPECT_EQ(opus["genre"], "Ambient");
+  EXPECT_EQ(opus["year"], 1999);
+  EXPECT_EQ(opus["duration_ms"], 7500);
+  EXPECT_EQ(opus["mime"], "audio/ogg");
   EXPECT_EQ(Paths({"--year", "2011", "song"}), std::set<std::string>{"/photo/mixed/music/song.mp3"});
 
   auto kestrel = Search({"--camera", "kestrel k-100"});
@@ -177,6 +236,13 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   EXPECT_EQ(Paths({"--text", "guillemot"}), std::set<std::string>{"/photo/mixed/papers/minutes.odt"});
   EXPECT_EQ(Paths({"--text", "kitti"}), std::set<std::string>{"/photo/mixed/papers/notes.txt"});
   EXPECT_TRUE(Paths({"--text", "puffin albatross"}).empty());
+  // Hits show the words around the match, marked.
+  const Json::Value snippet = RunJson({"search", "--text", "cormo"});
+  ASSERT_EQ(snippet["hits"].size(), 1u);
+  EXPECT_EQ(snippet["hits"][0]["snippet"],
+            "…for the albatross project the second page mentions a «cormorant»");
+  EXPECT_NE(Run({"search", "--text", "albatross"}).out.find("figures for the «albatross» project"),
+            std::string::npos);
   EXPECT_EQ(Search({"--title", "seabird"})["/photo/mixed/papers/report.pdf"]["text_bytes"].asInt() > 40,
             true);
   // The table shows the main fields.
@@ -190,8 +256,13 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   EXPECT_TRUE(Search({"--artist", "gulls"}).empty());
   EXPECT_EQ(Why("/photo/mixed/music/song.mp3")["state"], "kind-off");
   EXPECT_EQ(Paths({"--text", "albatross"}).size(), 1u);  // the other kinds stay
+  // A song whose name says nothing stays, by its name only.
+  ASSERT_TRUE(WaitExtracted({"music/take1"}));
+  EXPECT_EQ(Kinds({"take1"})["/photo/mixed/music/take1"], "other");
+  EXPECT_EQ(Why("/photo/mixed/music/take1")["content"]["state"], "skipped");
   ASSERT_EQ(Run({"folders", "set", "/photo/mixed", "--audio"}).status, 0);
   EXPECT_TRUE(WaitUntil([&] { return Search({"--artist", "gulls"}).size() == 1; }, kDeadline)) << Log();
+  EXPECT_TRUE(WaitUntil([&] { return Search({"--artist", "night heron"}).size() == 1; }, kDeadline)) << Log();
 
   // A changed file is extracted again.
   WriteFile(top_ + "/papers/notes.txt", "now the fulmar\n");

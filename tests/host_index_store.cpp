@@ -126,7 +126,7 @@ TEST_F(IndexStoreTest, ContentFollowsItsEntryAndLayoutsAreMigratedOrRebuilt) {
     // One look covers a window of ids: a long run without work takes a few looks.
     std::vector<ContentCandidate> none;
     ASSERT_TRUE(writer_->Begin());
-    for (int i = 0; i < 5000; ++i) Put("other", std::to_string(i) + ".bin");
+    for (int i = 0; i < 5000; ++i) Put("other", std::to_string(i), 1, true);
     Put("other", "last.txt");
     ASSERT_TRUE(writer_->Commit());
     std::int64_t after = pending.back().id;
@@ -199,6 +199,54 @@ TEST_F(IndexStoreTest, ContentFollowsItsEntryAndLayoutsAreMigratedOrRebuilt) {
   ASSERT_TRUE(writer_) << error;
   EXPECT_EQ(All(), std::set<std::string>{"docs/c.txt"});
   EXPECT_TRUE(ContentReader::Open(dir_ + "/db", error)) << error;
+
+  // The content's kind becomes the entry's (a PDF named as a photo is a document); types
+  // and reasons are kept once for all files.
+  Put("docs", "d.jpg");
+  Put("docs", "e.jpg");
+  pending.clear();
+  ASSERT_TRUE(writer_->PendingContent(0, 10, pending, next, atEnd));
+  ASSERT_EQ(pending.size(), 3u);
+  content = Content();
+  content.state = ExtractState::kFailed;
+  content.mime = "application/pdf";
+  content.reason = "the PDF is encrypted";
+  for (int i : {1, 2}) {
+    pending[i].entry.kind = content.kind = Kind::kDocument;
+    ASSERT_TRUE(writer_->PutContent(pending[i], content, "", stored));
+  }
+  auto lookup = [&](const std::string& path) {
+    auto reader = ContentReader::Open(dir_ + "/db", error);
+    EXPECT_TRUE(reader) << error;
+    Entry found;
+    bool exists = false, has = false;
+    content = Content();
+    EXPECT_TRUE(reader && reader->Lookup(path, found, exists, content, has) && exists && has) << path;
+    return std::string(KindName(found.kind)) + " " + content.mime + " " + content.reason;
+  };
+  EXPECT_EQ(lookup("docs/e.jpg"), "document application/pdf the PDF is encrypted");
+  EXPECT_EQ(rows("SELECT count(*) FROM content_strings WHERE text = 'application/pdf'"), 1);
+  // The second layout kept both in each row, and the content's kind beside the content
+  // only: the writer moves them over.
+  writer_.reset();
+  setLayout(
+      "UPDATE entries SET kind = 4 WHERE name = 'e.jpg'; DELETE FROM contents WHERE id != (SELECT id FROM"
+      " entries WHERE name = 'e.jpg'); ALTER TABLE contents RENAME TO contents_3;"
+      "CREATE TABLE contents(id INTEGER PRIMARY KEY, mtime INTEGER NOT NULL, size INTEGER NOT NULL,"
+      " state INTEGER NOT NULL, mime TEXT NOT NULL, kind INTEGER NOT NULL, reason TEXT NOT NULL, title TEXT,"
+      " artist TEXT, album TEXT, genre TEXT, year INTEGER, duration_ms INTEGER, width INTEGER, height"
+      " INTEGER, taken TEXT, make TEXT, model TEXT, latitude REAL, longitude REAL, codecs TEXT, author TEXT,"
+      " text_bytes INTEGER NOT NULL, text_truncated INTEGER NOT NULL);"
+      "INSERT INTO contents SELECT id, mtime, size, 1, 'application/pdf', kind, '', 'Invoice', NULL, NULL,"
+      " NULL, NULL, NULL, NULL, NULL, NULL, NULL, NULL, NULL, NULL, NULL, NULL, 0, 0 FROM contents_3;"
+      "DROP TABLE contents_3; CREATE INDEX contents_by_taken ON contents(taken) WHERE taken IS NOT NULL; "
+      "DROP TABLE content_strings; PRAGMA user_version=2;");
+  EXPECT_FALSE(ContentReader::Open(dir_ + "/db", error));
+  writer_ = IndexWriter::Open(dir_ + "/db", error);
+  ASSERT_TRUE(writer_) << error;
+  EXPECT_EQ(lookup("docs/e.jpg"), "document application/pdf ");
+  EXPECT_EQ(content.title, "Invoice");
+  EXPECT_EQ(rows("SELECT count(*) FROM sqlite_master WHERE name IN ('contents_by_taken', 'contents_2')"), 1);
 
   // A newer layout: nothing reads it; the writer starts it again from nothing.
   writer_.reset();

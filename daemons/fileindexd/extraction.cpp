@@ -99,7 +99,7 @@ void Extraction::Wake() {
   // A share whose pass ended may have new files now; it is looked at again from the start.
   for (auto& entry : m_shares()) {
     ShareCursor& cursor = m_cursors[entry.first];
-    if (cursor.exhausted && entry.second->entriesWritten() != cursor.writtenAtEnd) {
+    if (cursor.exhausted && entry.second->changes() != cursor.writtenAtEnd) {
       // New files have ids above the cursor; a changed file keeps its id and is found by
       // the pass from the start that follows.
       cursor.exhausted = false;
@@ -189,7 +189,7 @@ bool Extraction::NextCandidate(std::string& shareName, ContentCandidate& candida
         }
         if (cursor.batch.empty()) {
           cursor.exhausted = true;
-          cursor.writtenAtEnd = indexer.entriesWritten();
+          cursor.writtenAtEnd = indexer.changes();
           break;
         }
       }
@@ -237,6 +237,7 @@ void Extraction::Pump() {
       Result result{share, std::move(candidate), Content(), ""};
       result.content.mime = "inode/x-empty";
       result.content.kind = result.candidate.entry.kind;
+      if (result.content.kind == Kind::kOther) result.content.state = ExtractState::kSkipped;  // of no kind
       Record(std::move(result));
       // A few at a time: the loop has sockets and slices to serve.
       if (++inline_ >= kBatch) {
@@ -415,10 +416,11 @@ void Extraction::Flush() {
     for (Result* result : entry.second) {
       if (!ok) break;
       Content& content = result->content;
+      Kind& kind = result->candidate.entry.kind;  // the name's hint until here
       // The content decides the kind; a folder that does not index that kind keeps the
-      // file by its name only.
-      if (content.state == ExtractState::kDone && content.kind != result->candidate.entry.kind &&
-          content.kind != Kind::kOther && !indexer.AllowsKind(result->candidate.entry.folder, content.kind)) {
+      // file by its name only, as the kind its name suggests.
+      if (content.kind != Kind::kOther && content.kind != kind &&
+          !indexer.AllowsKind(result->candidate.entry.folder, content.kind)) {
         Content skipped;
         skipped.state = ExtractState::kSkipped;
         skipped.mime = content.mime;
@@ -427,6 +429,8 @@ void Extraction::Flush() {
                          content.mime + "), which this folder does not index";
         content = skipped;
         result->text.clear();
+      } else if (content.kind != Kind::kOther) {
+        kind = content.kind;
       }
       bool stored = false;
       ok = store.PutContent(result->candidate, content, result->text, stored);

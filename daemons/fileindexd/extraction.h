@@ -53,7 +53,7 @@ class Extraction {
     std::int64_t afterId = 0;
     bool exhausted = false;
     bool fromStart = false;          // after the new files, the whole index once more (changed files)
-    std::uint64_t writtenAtEnd = 0;  // the share's entriesWritten when its pass ended
+    std::uint64_t writtenAtEnd = 0;  // the share's changes() when its pass ended
     std::vector<fileindex_store::ContentCandidate> batch;
     std::size_t next = 0;
   };

@@ -38,6 +38,9 @@ using fileindex_store::Kind;
 namespace {
 
 magic_t g_magic = nullptr;
+// What is read of a file whose name suggests no kind to tell its type: enough for the
+// signatures of every kind extracted, the member names of a zip included.
+constexpr std::size_t kSniffBytes = 16 * 1024;
 // Without the pattern tests: a few microseconds where the full look at a text file takes
 // milliseconds, and enough to tell text from anything else.
 magic_t g_quickMagic = nullptr;
@@ -171,7 +174,10 @@ void ExtractPhoto(const std::string& path, Content& content) {
         GpsCoordinate(exif, "Exif.GPSInfo.GPSLatitude", "Exif.GPSInfo.GPSLatitudeRef", content.latitude) &&
         GpsCoordinate(exif, "Exif.GPSInfo.GPSLongitude", "Exif.GPSInfo.GPSLongitudeRef", content.longitude);
   } catch (const Exiv2::AnyError& error) {
-    throw ExtractError(std::string("Exiv2: ") + error.what());
+    // Exiv2 names the file it was given, here a descriptor's name that means nothing later.
+    std::string message = error.what();
+    if (message.compare(0, path.size() + 2, path + ": ") == 0) message.erase(0, path.size() + 2);
+    throw ExtractError("Exiv2: " + message);
   }
 }
 
@@ -498,7 +504,16 @@ void ExtractFile(const std::string& path, Kind hint, const ExtractLimits& limits
   const std::string byDescriptor = "/proc/self/fd/" + std::to_string(fd);
   try {
     const char* mime = nullptr;
-    if (hint == Kind::kDocument && TextExtension(path)) {
+    if (hint == Kind::kOther) {
+      // A name that says nothing: most such files are of no kind, so their type is told
+      // from their first bytes only (libmagic would otherwise read up to megabytes).
+      char head[kSniffBytes];
+      ssize_t n;
+      while ((n = ::pread(fd, head, sizeof(head), 0)) < 0 && errno == EINTR) {
+      }
+      if (n < 0) throw ExtractError(std::string("read: ") + std::strerror(errno));
+      mime = magic_buffer(g_magic, head, static_cast<std::size_t>(n));
+    } else if (hint == Kind::kDocument && TextExtension(path)) {
       mime = magic_descriptor(g_quickMagic, fd);
       if (mime != nullptr && !StartsWith(mime, "text/")) mime = nullptr;
       ::lseek(fd, 0, SEEK_SET);
@@ -512,6 +527,11 @@ void ExtractFile(const std::string& path, Kind hint, const ExtractLimits& limits
     }
     Kind kind = KindOfMime(content.mime);
     if (kind == Kind::kOther) kind = hint;  // the type says nothing more: trust the name
+    // Text without a name saying so is a document when it is prose; source code, scripts
+    // and configuration files are not.
+    if (hint == Kind::kOther && kind == Kind::kDocument && IsTextMime(content.mime) &&
+        content.mime != "text/plain")
+      kind = Kind::kOther;
     content.kind = kind;
     switch (kind) {
       case Kind::kPhoto:
@@ -549,6 +569,13 @@ void ExtractFile(const std::string& path, Kind hint, const ExtractLimits& limits
   } catch (const std::exception& error) {
     content.state = ExtractState::kFailed;
     content.reason = Utf8(error.what(), std::strlen(error.what()), 1024);
+  }
+  if (content.state == ExtractState::kFailed && hint == Kind::kOther && content.kind != Kind::kOther) {
+    // Some types are told by weak signatures that random bytes match too: a file whose
+    // name says nothing and which is not what its first bytes suggest is no failed photo.
+    content.state = ExtractState::kSkipped;
+    content.kind = Kind::kOther;
+    content.reason = "taken for " + content.mime + ", but: " + content.reason;
   }
   if (content.state != ExtractState::kDone) text.clear();
 }

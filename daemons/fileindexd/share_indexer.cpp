@@ -84,6 +84,13 @@ bool ShareIndexer::Configure(const ShareConfig& config) {
     if (it == known.end() || !it->second.crawled || it->second.document != flags.document ||
         it->second.audio != flags.audio || it->second.video != flags.video ||
         it->second.photo != flags.photo) {
+      // Files kept by their names because their content's kind was off are looked at again.
+      std::uint64_t forgotten = 0;
+      if (it != known.end() && !m_store->ForgetKindSkipped(entry.first, forgotten)) {
+        m_error = m_store->LastError();
+        return false;
+      }
+      m_contentsForgotten += forgotten;
       CrawlFolder(entry.first, false);
     }
   }
@@ -160,6 +167,18 @@ bool ShareIndexer::KindAllowed(const std::string& folder, Kind kind) const {
   return true;  // no flag covers other files: they are found by name whatever the flags
 }
 
+ShareIndexer::KindVerdict ShareIndexer::DecideKind(const std::string& folder, const Entry* indexed,
+                                                   Entry& entry) const {
+  if (entry.isDir) return KindVerdict::kKeep;
+  const Kind byName = entry.kind;
+  if (indexed != nullptr && !indexed->isDir && indexed->size == entry.size && indexed->mtime == entry.mtime)
+    entry.kind = indexed->kind;
+  if (KindAllowed(folder, entry.kind)) return KindVerdict::kKeep;
+  if (entry.kind == byName || !KindAllowed(folder, byName)) return KindVerdict::kDrop;
+  entry.kind = byName;
+  return KindVerdict::kByName;
+}
+
 Entry ShareIndexer::EntryFor(const std::string& parent, const std::string& name, const struct stat& st,
                              const std::string& folder) const {
   Entry entry;
@@ -201,19 +220,17 @@ bool ShareIndexer::ReconcilePath(const std::string& path) {
   struct stat st;
   std::string folder;
   bool keep = ::lstat(full.c_str(), &st) == 0 && GoverningFolder(full, folder) && !IsExcluded(folder, path);
-  Entry entry;
-  if (keep) {
-    entry = EntryFor(parent, name, st, folder);
-    keep = entry.isDir || KindAllowed(folder, entry.kind);
-  }
   if (!keep) return m_store->Remove(parent, name);
-
+  Entry entry = EntryFor(parent, name, st, folder);
   Entry indexed;
   bool found = false;
   if (!m_store->Find(parent, name, indexed, found)) return false;
+  const KindVerdict verdict = DecideKind(folder, found ? &indexed : nullptr, entry);
+  if (verdict == KindVerdict::kDrop) return m_store->Remove(parent, name);
   if (found && SameEntry(indexed, entry)) return true;
   if (found && indexed.isDir && !entry.isDir && !m_store->RemoveBelow(path)) return false;
   if (!m_store->Put(entry)) return false;
+  if (verdict == KindVerdict::kByName && !m_store->ForgetContent(parent, name)) return false;
   ++m_entriesWritten;
   // A directory that is new to the index (created, moved in, renamed) is crawled.
   if (entry.isDir && (!found || !indexed.isDir || indexed.folder != entry.folder))
@@ -269,8 +286,9 @@ bool ShareIndexer::ReconcileDirectory(const Task& task) {
     std::string entryFolder = folder;
     if (isDir && m_config.flags.count(path) && !GoverningFolder(full + "/" + name, entryFolder)) continue;
     Entry entry = EntryFor(dir, name, st, entryFolder);
-    if (!entry.isDir && !KindAllowed(folder, entry.kind)) continue;
     auto it = indexed.find(name);
+    const KindVerdict verdict = DecideKind(folder, it != indexed.end() ? &it->second : nullptr, entry);
+    if (verdict == KindVerdict::kDrop) continue;  // left in `indexed`, so removed below
     if (it != indexed.end()) {
       bool same = SameEntry(it->second, entry);
       bool wasDir = it->second.isDir;
@@ -282,6 +300,7 @@ bool ShareIndexer::ReconcileDirectory(const Task& task) {
       }
     }
     if (!m_store->Put(entry)) return false;
+    if (verdict == KindVerdict::kByName && !m_store->ForgetContent(dir, name)) return false;
     ++m_entriesWritten;
     if (isDir) subdirectories.push_back({TaskType::kTree, path, entryFolder, true});
   }

@@ -51,6 +51,8 @@ class ShareIndexer {
 
   // Figures for logs and tests.
   std::uint64_t entriesWritten() const { return m_entriesWritten; }
+  // Grows whenever the index gains files whose contents are to be extracted.
+  std::uint64_t changes() const { return m_entriesWritten + m_contentsForgotten; }
 
   // For the extraction of contents, which writes into the same index between slices.
   fileindex_store::IndexWriter& Store() { return *m_store; }
@@ -91,6 +93,12 @@ class ShareIndexer {
   fileindex_store::Entry EntryFor(const std::string& parent, const std::string& name, const struct stat& st,
                                   const std::string& folder) const;
   bool KindAllowed(const std::string& folder, fileindex_store::Kind kind) const;
+  // A file's entry is indexed as the kind its content was found to be while the file is
+  // the version extracted, else as its name suggests. kDrop: its kind is switched off in
+  // folder; kByName: its content's kind is, and it is kept by its name only.
+  enum class KindVerdict { kKeep, kDrop, kByName };
+  KindVerdict DecideKind(const std::string& folder, const fileindex_store::Entry* indexed,
+                         fileindex_store::Entry& entry) const;
 
   // Queue consumption.
   void ReadQueue();
@@ -110,6 +118,7 @@ class ShareIndexer {
   std::map<std::string, QueuedCrawl> m_queuedCrawls;
   std::string m_error;
   std::uint64_t m_entriesWritten = 0;
+  std::uint64_t m_contentsForgotten = 0;
 
   bool m_haveQueue = false;  // the ".tmp" companion is being consumed
   int m_queueFd = -1;

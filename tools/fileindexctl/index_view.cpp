@@ -74,6 +74,7 @@ void SearchShares(const std::map<std::string, IndexedShare>& shares,
       result.hit = std::move(hit);
       result.hasContent = item.hasContent;
       result.content = std::move(item.content);
+      result.snippet = std::move(item.snippet);
       hits.push_back(std::move(result));
     }
   }

@@ -34,6 +34,7 @@ struct SearchHit {
   fileindex_store::Hit hit;
   bool hasContent = false;  // what is inside the file, once extracted
   fileindex_store::Content content;
+  std::string snippet;  // when text was searched: its matching words marked as the store marks them
 };
 
 // Searches each share's index (newest first, at most query.names.limit in all); hits in

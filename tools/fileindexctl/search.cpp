@@ -64,6 +64,29 @@ std::string HumanSize(std::int64_t bytes) {
   return text;
 }
 
+// A snippet on one line, runs of white space as one space, its matching words between open
+// and close.
+std::string ShowSnippet(const std::string& snippet, const char* open, const char* close) {
+  std::string out;
+  bool space = false;
+  for (char c : snippet) {
+    if (c == ' ' || c == '\n' || c == '\r' || c == '\t' || c == '\f') {
+      space = true;
+      continue;
+    }
+    if (space && !out.empty()) out += ' ';
+    space = false;
+    if (c == fileindex_store::kSnippetOpen) {
+      out += open;
+    } else if (c == fileindex_store::kSnippetClose) {
+      out += close;
+    } else {
+      out += c;
+    }
+  }
+  return out;
+}
+
 int Search(Session& s, const SearchArgs& args) {
   // File names are private to those who may read the files: only root searches here;
   // users search through Samba, which checks every hit against their own permissions.
@@ -129,6 +152,7 @@ int Search(Session& s, const SearchArgs& args) {
     item["size"] = static_cast<Json::Int64>(found.hit.size);
     item["mtime"] = static_cast<Json::Int64>(found.hit.mtime);
     item["content"] = found.hasContent ? ContentJson(found.content) : Json::Value();
+    if (!query.text.empty()) item["snippet"] = ShowSnippet(found.snippet, "«", "»");
     result["hits"].append(item);
   }
   result["count"] = static_cast<Json::UInt64>(hits.size());
@@ -141,7 +165,11 @@ int Search(Session& s, const SearchArgs& args) {
       std::printf("no match\n");
       return;
     }
-    Table table({"PATH", "KIND", "SIZE", "MODIFIED", "DETAILS"});
+    std::vector<std::string> headers{"PATH", "KIND", "SIZE", "MODIFIED", "DETAILS"};
+    // The matching words of the text: in bold on a terminal, else between guillemets.
+    const bool bold = ::isatty(STDOUT_FILENO) == 1;
+    if (!query.text.empty()) headers.push_back("TEXT");
+    Table table(headers);
     for (const SearchHit& found : hits) {
       std::string details;
       if (found.hasContent) {
@@ -149,9 +177,14 @@ int Search(Session& s, const SearchArgs& args) {
       } else if (!found.hit.isDir && found.hit.kind != fileindex_store::Kind::kOther) {
         details = "(contents pending)";
       }
-      table.AddRow({found.path + (found.hit.isDir ? "/" : ""),
-                    found.hit.isDir ? "directory" : fileindex_store::KindName(found.hit.kind),
-                    found.hit.isDir ? "" : HumanSize(found.hit.size), LocalTime(found.hit.mtime), details});
+      std::vector<std::string> row{found.path + (found.hit.isDir ? "/" : ""),
+                                   found.hit.isDir ? "directory" : fileindex_store::KindName(found.hit.kind),
+                                   found.hit.isDir ? "" : HumanSize(found.hit.size),
+                                   LocalTime(found.hit.mtime), details};
+      if (!query.text.empty())
+        row.push_back(bold ? ShowSnippet(found.snippet, "\033[1m", "\033[0m")
+                           : ShowSnippet(found.snippet, "«", "»"));
+      table.AddRow(row);
     }
     table.Print(stdout);
   });

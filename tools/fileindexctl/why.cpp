@@ -112,12 +112,18 @@ Answer Explain(const std::string& path) {
   }
   answer.indexed = true;
   if (hasContent) answer.content = ContentJson(content);
-  if (isDir || kind == Kind::kOther) {
+  if (isDir) {
     answer.state = "indexed";
     answer.reason = "indexed by its name";
   } else if (!hasContent) {
     answer.state = "content-pending";
-    answer.reason = "indexed by its name; its contents are still to be extracted";
+    answer.reason = kind == Kind::kOther
+                        ? "indexed by its name; its type is still to be told from its content"
+                        : "indexed by its name; its contents are still to be extracted";
+  } else if (content.state == ExtractState::kSkipped && content.kind == Kind::kOther &&
+             entry.kind == Kind::kOther) {
+    answer.state = "indexed";
+    answer.reason = "indexed by its name (" + content.mime + ")";
   } else if (content.state == ExtractState::kFailed) {
     answer.state = "failed";
     answer.reason = "indexed by its name; extracting its contents failed: " + content.reason;
