@@ -128,3 +128,9 @@ std::vector<std::string> FakeDaemon::RawFrames() {
   for (const auto& frame : frames_) out.push_back(frame.raw);
   return out;
 }
+
+void FakeDaemon::Clear() {
+  std::unique_lock<std::mutex> lock(mu_);
+  SettleLocked(lock);
+  frames_.clear();
+}

@@ -42,6 +42,8 @@ class FakeDaemon {
   std::vector<Json::Value> Commands();
   // Every connection's bytes as received (length prefix included), in arrival order.
   std::vector<std::string> RawFrames();
+  // Forgets what was recorded (the benchmarks reuse one daemon between runs).
+  void Clear();
 
   const std::string& SocketPath() const { return path_; }
 
