@@ -176,37 +176,47 @@ class Reader {
   // A folder's record, an object at depth 1, as Container reads it, noting the members
   // a folder is loaded from.
   const char* Record(const char* p, FolderConfRecord& record) const {
-    static const char* const kFlags[] = {"document", "audio", "video", "photo"};
     // Which of the flags and "name" the record has held so far.
     bool seen[5] = {false, false, false, false, false};
-    return Elements(p, '}', true,
-                    [&](const FolderConfName& member, bool escaped, const char* value) -> const char* {
-                      // An escaped member name might spell one of those above.
-                      if (escaped) return nullptr;
-                      int known = -1;
-                      for (int i = 0; i < 4; ++i) {
-                        if (Is(member, kFlags[i])) known = i;
-                      }
-                      if (Is(member, "name")) known = 4;
-                      if (known < 0) return Value(value, 2);
-                      // The parsed record keeps the last of repeated members: left to the parse.
-                      if (seen[known]) return nullptr;
-                      seen[known] = true;
-                      if (known < 4) {
-                        if (At(value, 't') || At(value, 'f')) record.flags[known] = At(value, 't') ? 1 : 0;
-                        return Value(value, 2);
-                      }
-                      if (!At(value, '"')) return Value(value, 2);
-                      const char* end = String(value, escaped);
-                      if (end == nullptr || escaped) return nullptr;
-                      record.name = value + 1;
-                      record.nameSize = static_cast<size_t>(end - 1 - record.name);
-                      return end;
-                    });
+    return Elements(p, '}', true, [&](const FolderConfName& member, bool escaped, const char* value) {
+      return RecordMember(member, escaped, value, record, seen);
+    });
   }
 
-  static bool Is(const FolderConfName& name, const char* word) {
-    return name.size == std::strlen(word) && std::memcmp(name.data, word, name.size) == 0;
+  const char* RecordMember(const FolderConfName& member, bool escaped, const char* value,
+                           FolderConfRecord& record, bool (&seen)[5]) const {
+    // An escaped member name might spell one of the known ones.
+    if (escaped) return nullptr;
+    const int known = KnownMember(member);
+    if (known < 0) return Value(value, 2);
+    // The parsed record keeps the last of repeated members: left to the parse.
+    if (seen[known]) return nullptr;
+    seen[known] = true;
+    if (known < 4) {
+      if (At(value, 't') || At(value, 'f')) record.flags[known] = At(value, 't') ? 1 : 0;
+      return Value(value, 2);
+    }
+    if (!At(value, '"')) return Value(value, 2);
+    const char* end = String(value, escaped);
+    if (end == nullptr || escaped) return nullptr;
+    record.name = value + 1;
+    record.nameSize = static_cast<size_t>(end - 1 - record.name);
+    return end;
+  }
+
+  // The member's index in FolderConfRecord::flags, 4 for "name", -1 for any other.
+  static int KnownMember(const FolderConfName& name) {
+    auto is = [&name](const char* word) { return std::memcmp(name.data, word, name.size) == 0; };
+    switch (name.size) {
+      case 4:
+        return is("name") ? 4 : -1;
+      case 5:
+        return is("audio") ? 1 : is("video") ? 2 : is("photo") ? 3 : -1;
+      case 8:
+        return is("document") ? 0 : -1;
+      default:
+        return -1;
+    }
   }
 
   const char* Container(const char* p, int depth, char close, bool object) const {
