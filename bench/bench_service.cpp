@@ -739,13 +739,17 @@ bool ServiceScenarios(const Options& options) {
          oneTx.ok ? Format("naive %.1f MB", static_cast<double>(oneTx.hwmKb) / 1024) : "",
          Verdict(hwm > 0 && hwm < 64 * 1024, "< 64 MB"));
   AddRow("peak_memory", "tavotifyd", Format("%.1f MB VmHWM", static_cast<double>(notifierHwm) / 1024));
-  const std::uint64_t bytes = IndexBytes(dbDir);
-  AddRow("index_size", "fileindexd",
-         Format("%.0f B/entry (%.1f MB)", static_cast<double>(bytes) / static_cast<double>(indexed),
-                static_cast<double>(bytes) / 1e6),
-         oneTx.ok ? Format("naive %.0f B/entry",
-                           static_cast<double>(naiveBytes) / static_cast<double>(oneTx.entries))
-                  : "");
+  // The index is measured once the daemon has stopped and folded its write-ahead log in:
+  // a log grown during the crawl (and the extraction after it) is not the index's size.
+  auto indexSize = [&, naiveBytes] {
+    const std::uint64_t bytes = IndexBytes(dbDir);
+    AddRow("index_size", "fileindexd",
+           Format("%.0f B/entry (%.1f MB)", static_cast<double>(bytes) / static_cast<double>(indexed),
+                  static_cast<double>(bytes) / 1e6),
+           oneTx.ok ? Format("naive %.0f B/entry",
+                             static_cast<double>(naiveBytes) / static_cast<double>(oneTx.entries))
+                    : "");
+  };
 
   // Scenario 2: a file created in an indexed folder until a search finds it.
   std::printf("created files until searchable...\n");
@@ -797,6 +801,7 @@ bool ServiceScenarios(const Options& options) {
          Format("n=%zu", polls.size()));
   reader.reset();
   StopDaemons();
+  indexSize();
   return true;
 }
 
