@@ -198,6 +198,11 @@ TEST_F(ServiceTest, FoldersFollowTheFileSystemAndTheSettings) {
   fs::rename(dir2019 + "/sunset.jpg", dir2019 + "/dusk.jpg");
   ASSERT_TRUE(WaitFound("dusk", "/photo/2019/dusk.jpg"));
   EXPECT_TRUE(Search("sunset").empty());
+  // Its content, text, makes it a document; the kind its name gives still decides below.
+  ASSERT_TRUE(WaitUntil([&] {
+    Search("dusk");
+    return lastSearch_["hits"].size() == 1 && lastSearch_["hits"][0]["content"]["state"] == "extracted";
+  })) << lastSearch_.toStyledString();
 
   // Photos off in 2019: its photos go, its documents and 2020's photos stay.
   ASSERT_EQ(Run({"folders", "set", "/photo/2019", "--no-photo"}).status, 0);

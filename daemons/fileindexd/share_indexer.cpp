@@ -171,10 +171,13 @@ ShareIndexer::KindVerdict ShareIndexer::DecideKind(const std::string& folder, co
                                                    Entry& entry) const {
   if (entry.isDir) return KindVerdict::kKeep;
   const Kind byName = entry.kind;
+  // A kind that the name gives and the folder switches off drops the file whatever its
+  // content: what the index holds must not depend on whether the content was read
+  // before the flag changed.
+  if (!KindAllowed(folder, byName)) return KindVerdict::kDrop;
   if (indexed != nullptr && !indexed->isDir && indexed->size == entry.size && indexed->mtime == entry.mtime)
     entry.kind = indexed->kind;
   if (KindAllowed(folder, entry.kind)) return KindVerdict::kKeep;
-  if (entry.kind == byName || !KindAllowed(folder, byName)) return KindVerdict::kDrop;
   entry.kind = byName;
   return KindVerdict::kByName;
 }

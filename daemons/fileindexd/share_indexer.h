@@ -94,8 +94,9 @@ class ShareIndexer {
                                   const std::string& folder) const;
   bool KindAllowed(const std::string& folder, fileindex_store::Kind kind) const;
   // A file's entry is indexed as the kind its content was found to be while the file is
-  // the version extracted, else as its name suggests. kDrop: its kind is switched off in
-  // folder; kByName: its content's kind is, and it is kept by its name only.
+  // the version extracted, else as its name suggests. kDrop: the kind its name suggests
+  // is switched off in folder; kByName: its content's kind is, and it is kept by its name
+  // only.
   enum class KindVerdict { kKeep, kDrop, kByName };
   KindVerdict DecideKind(const std::string& folder, const fileindex_store::Entry* indexed,
                          fileindex_store::Entry& entry) const;
