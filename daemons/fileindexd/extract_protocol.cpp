@@ -1,5 +1,6 @@
 #include "extract_protocol.h"
 
+#include <content_json.h>
 #include <json/json.h>
 
 #include <memory>
@@ -37,16 +38,6 @@ bool Parse(const std::string& text, Json::Value& out) {
   return reader->parse(text.data(), text.data() + text.size(), &out, nullptr) && out.isObject();
 }
 
-std::string Text(const Json::Value& object, const char* key) {
-  const Json::Value& value = object[key];
-  return value.isString() ? value.asString() : std::string();
-}
-
-std::int64_t Int(const Json::Value& object, const char* key) {
-  const Json::Value& value = object[key];
-  return value.isInt64() ? value.asInt64() : 0;
-}
-
 }  // namespace
 
 std::string EncodeFrame(const std::string& json, const std::string& text) {
@@ -69,31 +60,7 @@ std::string EncodeResult(const Content& content, const std::string& text) {
   result["state"] = static_cast<int>(content.state);
   result["mime"] = content.mime;
   result["kind"] = static_cast<int>(content.kind);
-  auto text_ = [&result](const char* key, const std::string& value) {
-    if (!value.empty()) result[key] = value;
-  };
-  auto int_ = [&result](const char* key, std::int64_t value) {
-    if (value != 0) result[key] = static_cast<Json::Int64>(value);
-  };
-  text_("reason", content.reason);
-  text_("title", content.title);
-  text_("artist", content.artist);
-  text_("album", content.album);
-  text_("genre", content.genre);
-  int_("year", content.year);
-  int_("duration_ms", content.durationMs);
-  int_("width", content.width);
-  int_("height", content.height);
-  text_("taken", content.taken);
-  text_("make", content.make);
-  text_("model", content.model);
-  if (content.hasPosition) {
-    result["latitude"] = content.latitude;
-    result["longitude"] = content.longitude;
-  }
-  text_("codecs", content.codecs);
-  text_("author", content.author);
-  if (content.textTruncated) result["text_truncated"] = true;
+  fileindex_store::PutContentFields(content, result);
   return EncodeFrame(Compact(result), text);
 }
 
@@ -117,27 +84,8 @@ bool DecodeResult(const std::string& json, Content& content) {
   content = Content();
   content.state = static_cast<ExtractState>(state);
   content.kind = static_cast<Kind>(kind);
-  content.mime = Text(result, "mime");
-  content.reason = Text(result, "reason");
-  content.title = Text(result, "title");
-  content.artist = Text(result, "artist");
-  content.album = Text(result, "album");
-  content.genre = Text(result, "genre");
-  content.year = Int(result, "year");
-  content.durationMs = Int(result, "duration_ms");
-  content.width = Int(result, "width");
-  content.height = Int(result, "height");
-  content.taken = Text(result, "taken");
-  content.make = Text(result, "make");
-  content.model = Text(result, "model");
-  content.hasPosition = result["latitude"].isDouble() && result["longitude"].isDouble();
-  if (content.hasPosition) {
-    content.latitude = result["latitude"].asDouble();
-    content.longitude = result["longitude"].asDouble();
-  }
-  content.codecs = Text(result, "codecs");
-  content.author = Text(result, "author");
-  content.textTruncated = result["text_truncated"].isBool() && result["text_truncated"].asBool();
+  content.mime = result["mime"].isString() ? result["mime"].asString() : std::string();
+  fileindex_store::GetContentFields(result, content);
   return true;
 }
 

@@ -1,5 +1,7 @@
 #include "content_view.h"
 
+#include <content_json.h>
+
 #include <cstdio>
 #include <vector>
 
@@ -27,32 +29,8 @@ Json::Value ContentJson(const Content& content) {
   item["state"] = fileindex_store::ExtractStateName(content.state);
   item["mime"] = content.mime;
   item["kind"] = fileindex_store::KindName(content.kind);
-  auto text = [&item](const char* key, const std::string& value) {
-    if (!value.empty()) item[key] = value;
-  };
-  auto number = [&item](const char* key, std::int64_t value) {
-    if (value != 0) item[key] = static_cast<Json::Int64>(value);
-  };
-  text("reason", content.reason);
-  text("title", content.title);
-  text("artist", content.artist);
-  text("album", content.album);
-  text("genre", content.genre);
-  number("year", content.year);
-  number("duration_ms", content.durationMs);
-  number("width", content.width);
-  number("height", content.height);
-  text("taken", content.taken);
-  text("make", content.make);
-  text("model", content.model);
-  if (content.hasPosition) {
-    item["latitude"] = content.latitude;
-    item["longitude"] = content.longitude;
-  }
-  text("codecs", content.codecs);
-  text("author", content.author);
-  number("text_bytes", content.textBytes);
-  if (content.textTruncated) item["text_truncated"] = true;
+  if (content.textBytes != 0) item["text_bytes"] = static_cast<Json::Int64>(content.textBytes);
+  fileindex_store::PutContentFields(content, item);
   return item;
 }
 
