@@ -240,37 +240,31 @@ long VmHwmKb(pid_t pid) {
   return -1;
 }
 
-// CPU time (user and system) a process has used so far, in seconds.
-double CpuSeconds(pid_t pid) {
+// The sum of the fields first..last of /proc/PID/stat, clock ticks, in seconds; -1 when
+// the process is gone.
+double StatSeconds(pid_t pid, int first, int last) {
   std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
   std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
   std::string::size_type close = text.rfind(')');
   if (close == std::string::npos) return -1;
   std::istringstream fields(text.substr(close + 2));
   std::string field;
-  unsigned long long utime = 0, stime = 0;
-  // state is field 3; utime and stime are fields 14 and 15.
-  for (int i = 3; i <= 15 && fields >> field; ++i) {
-    if (i == 14) utime = std::strtoull(field.c_str(), nullptr, 10);
-    if (i == 15) stime = std::strtoull(field.c_str(), nullptr, 10);
+  unsigned long long ticks = 0;
+  // The first field after the command's name is field 3 (the state).
+  for (int i = 3; i <= last && fields >> field; ++i) {
+    if (i >= first) ticks += std::strtoull(field.c_str(), nullptr, 10);
   }
-  return static_cast<double>(utime + stime) / static_cast<double>(::sysconf(_SC_CLK_TCK));
+  return static_cast<double>(ticks) / static_cast<double>(::sysconf(_SC_CLK_TCK));
 }
 
-// CPU time of a process's children: those it has reaped, and those alive now.
+// CPU time (user and system, fields 14 and 15) a process has used so far, in seconds.
+double CpuSeconds(pid_t pid) { return StatSeconds(pid, 14, 15); }
+
+// CPU time of a process's children: those it has reaped (fields 16 and 17), and those
+// alive now.
 double ChildrenCpuSeconds(pid_t pid) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  std::string::size_type close = text.rfind(')');
-  if (close == std::string::npos) return -1;
-  std::istringstream fields(text.substr(close + 2));
-  std::string field;
-  unsigned long long reaped = 0;
-  // cutime and cstime are fields 16 and 17.
-  for (int i = 3; i <= 17 && fields >> field; ++i) {
-    if (i == 16 || i == 17) reaped += std::strtoull(field.c_str(), nullptr, 10);
-  }
-  double seconds = static_cast<double>(reaped) / static_cast<double>(::sysconf(_SC_CLK_TCK));
+  double seconds = StatSeconds(pid, 16, 17);
+  if (seconds < 0) return -1;
   std::ifstream children("/proc/" + std::to_string(pid) + "/task/" + std::to_string(pid) + "/children");
   for (long child; children >> child;) seconds += std::max(CpuSeconds(static_cast<pid_t>(child)), 0.0);
   return seconds;
@@ -526,7 +520,12 @@ class Sandbox {
     return Run(args);
   }
 
-  bool Init() { return Run({FILEINDEX_BENCH_CTL, "sandbox", "init", m_root}).status == 0; }
+  // Said on stderr when it fails.
+  bool Init() {
+    if (Run({FILEINDEX_BENCH_CTL, "sandbox", "init", m_root}).status == 0) return true;
+    std::fprintf(stderr, "sandbox init failed (see %s/commands.log)\n", g_workspace.c_str());
+    return false;
+  }
 
   bool Status(Json::Value& status) const {
     Output output = Ctl({"--json", "status"});
@@ -605,12 +604,31 @@ struct Options {
 };
 
 // Scenarios 1 and 2: the real daemons on a generated tree.
+// Starts the sandbox's daemons with the folder /photo/2019 and opens the photo share's
+// index read-only (dbDir its directory); null, said on stderr, when either fails.
+sqlite3* StartDaemons(Sandbox& sandbox, std::string& dbDir) {
+  std::printf("starting the daemons...\n");
+  std::fflush(stdout);
+  if (sandbox.Ctl({"folders", "add", "/photo/2019"}).status != 0 || !sandbox.WaitFinished(30) ||
+      !sandbox.RecordDaemons()) {
+    std::fprintf(stderr, "the daemons did not start (see %s/var/log)\n", sandbox.root().c_str());
+    return nullptr;
+  }
+  dbDir = sandbox.DatabaseDirectory("photo");
+  sqlite3* db = nullptr;
+  if (dbDir.empty() || sqlite3_open_v2(fileindex_store::IndexFilePath(dbDir).c_str(), &db,
+                                       SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
+    std::fprintf(stderr, "no index in %s\n", dbDir.c_str());
+    sqlite3_close(db);
+    return nullptr;
+  }
+  sqlite3_busy_timeout(db, 5000);
+  return db;
+}
+
 bool ServiceScenarios(const Options& options) {
   Sandbox sandbox(g_workspace + "/root");
-  if (!sandbox.Init()) {
-    std::fprintf(stderr, "sandbox init failed (see %s/commands.log)\n", g_workspace.c_str());
-    return false;
-  }
+  if (!sandbox.Init()) return false;
   const std::string share = sandbox.root() + "/volume1/photo";
   const std::string tree = share + "/bench";
   std::printf("generating %zu files in %zu directories in %s...\n", options.files, options.dirs,
@@ -639,21 +657,9 @@ bool ServiceScenarios(const Options& options) {
   fs::remove_all(naiveDir);
 
   // The daemons start with a small folder, so the figure is the crawl's alone.
-  std::printf("starting the daemons...\n");
-  std::fflush(stdout);
-  if (sandbox.Ctl({"folders", "add", "/photo/2019"}).status != 0 || !sandbox.WaitFinished(30) ||
-      !sandbox.RecordDaemons()) {
-    std::fprintf(stderr, "the daemons did not start (see %s/root/var/log)\n", g_workspace.c_str());
-    return false;
-  }
-  const std::string dbDir = sandbox.DatabaseDirectory("photo");
-  sqlite3* db = nullptr;
-  if (dbDir.empty() || sqlite3_open_v2(fileindex_store::IndexFilePath(dbDir).c_str(), &db,
-                                       SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
-    std::fprintf(stderr, "no index in %s\n", dbDir.c_str());
-    return false;
-  }
-  sqlite3_busy_timeout(db, 5000);
+  std::string dbDir;
+  sqlite3* db = StartDaemons(sandbox, dbDir);
+  if (db == nullptr) return false;
 
   std::printf("first full index by fileindexd...\n");
   std::fflush(stdout);
@@ -884,10 +890,7 @@ std::int64_t ContentCount(sqlite3* db, const std::string& folder, std::int64_t* 
 
 bool ContentScenario(const Options& options) {
   Sandbox sandbox(g_workspace + "/content-root");
-  if (!sandbox.Init()) {
-    std::fprintf(stderr, "sandbox init failed (see %s/commands.log)\n", g_workspace.c_str());
-    return false;
-  }
+  if (!sandbox.Init()) return false;
   const std::string share = sandbox.root() + "/volume1/photo";
   const std::size_t n = options.contentFiles;
   const std::vector<ContentKind> kinds = {{"c_photo", "photo", n},
@@ -932,21 +935,9 @@ bool ContentScenario(const Options& options) {
     inProcessRate[kind.label] = static_cast<double>(files) / std::max(ThreadCpuNow() - cpuBefore, 1e-9);
   }
 
-  std::printf("starting the daemons...\n");
-  std::fflush(stdout);
-  if (sandbox.Ctl({"folders", "add", "/photo/2019"}).status != 0 || !sandbox.WaitFinished(30) ||
-      !sandbox.RecordDaemons()) {
-    std::fprintf(stderr, "the daemons did not start (see %s/content-root/var/log)\n", g_workspace.c_str());
-    return false;
-  }
-  const std::string dbDir = sandbox.DatabaseDirectory("photo");
-  sqlite3* db = nullptr;
-  if (sqlite3_open_v2(fileindex_store::IndexFilePath(dbDir).c_str(), &db, SQLITE_OPEN_READONLY, nullptr) !=
-      SQLITE_OK) {
-    std::fprintf(stderr, "no index in %s\n", dbDir.c_str());
-    return false;
-  }
-  sqlite3_busy_timeout(db, 5000);
+  std::string dbDir;
+  sqlite3* db = StartDaemons(sandbox, dbDir);
+  if (db == nullptr) return false;
   auto reader = fileindex_store::ContentReader::Open(dbDir, error);
   if (!reader) {
     std::fprintf(stderr, "%s\n", error.c_str());
