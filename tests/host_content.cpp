@@ -48,20 +48,17 @@ class ContentTest : public SandboxTest {
     Result added = Run({"folders", "add", "/photo/mixed"}, true, environment);
     ASSERT_EQ(added.status, 0) << added.err;
   }
-  // share path -> content of the hits of a search
-  std::map<std::string, Json::Value> Search(std::vector<std::string> args) {
+  // share path -> member of the hits of a search ("content" or "kind")
+  std::map<std::string, Json::Value> Search(std::vector<std::string> args, const char* member = "content") {
     args.insert(args.begin(), {"search", "--limit", "1000"});
     std::map<std::string, Json::Value> hits;
     const Json::Value result = RunJson(args);
-    for (const Json::Value& hit : result["hits"]) hits[hit["path"].asString()] = hit["content"];
+    for (const Json::Value& hit : result["hits"]) hits[hit["path"].asString()] = hit[member];
     return hits;
   }
-  // share path -> kind of the hits of a search
-  std::map<std::string, std::string> Kinds(std::vector<std::string> args) {
-    args.insert(args.begin(), {"search", "--limit", "1000"});
+  std::map<std::string, std::string> Kinds(const std::vector<std::string>& args) {
     std::map<std::string, std::string> kinds;
-    const Json::Value result = RunJson(args);
-    for (const Json::Value& hit : result["hits"]) kinds[hit["path"].asString()] = hit["kind"].asString();
+    for (const auto& hit : Search(args, "kind")) kinds[hit.first] = hit.second.asString();
     return kinds;
   }
   std::set<std::string> Paths(const std::vector<std::string>& args) {
