@@ -74,7 +74,9 @@ class LineMaker {
     return recipe_.shareFull + "/" + dir + "/" + SubDir(rng_) + "/" + FileName(rng_);
   }
 
-  std::string Valid() {
+  std::string Valid() { return recipe_.writerOrder ? AsWritten(EventFirst()) : EventFirst(); }
+
+  std::string EventFirst() {
     const unsigned kind = rng_.Below(100);
     const std::string path = Path();
     if (kind < 10) {
@@ -93,6 +95,18 @@ class LineMaker {
            "\",\"data\":{\"inode\":" + std::to_string(rng_.Below(90000000)) +
            ",\"size\":" + std::to_string(rng_.Below(50000000)) +
            ",\"mtime\":" + std::to_string(1700000000 + rng_.Below(10000000)) + "}}";
+  }
+
+  // The line as the daemons write it.
+  static std::string AsWritten(const std::string& line) {
+    Json::Value record;
+    if (!TAVO::FILEINDEX::internal::JsonFromString(record, line))
+      throw std::runtime_error("bad line " + line);
+    if (!record.isMember("data")) record["data"] = Json::Value();
+    Json::StreamWriterBuilder builder;
+    builder["indentation"] = "";
+    builder["emitUTF8"] = true;
+    return Json::writeString(builder, record);
   }
 
   std::string Malformed() {

@@ -66,6 +66,10 @@ struct QueueRecipe {
   uint64_t lines = 0;
   unsigned malformedPerMille = 0;
   uint64_t seed = 1;
+  // Lines as the JSON library writes them, which is how the notification daemon and the
+  // library's own events are written: members in the order of their names, "data" always
+  // there. Otherwise "event" comes first, as the queue format is documented.
+  bool writerOrder = false;
 };
 
 struct QueueStats {

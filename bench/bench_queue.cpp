@@ -24,8 +24,9 @@ const uint64_t kQueueLines = 1000000;
 // Share "photo" with the folder /photo/2019 and a queue of a million lines, the last one
 // a pending reindex of the folder (so that the reindex check reads the whole file).
 struct QueueEnv {
-  explicit QueueEnv(unsigned malformedPerMille) {
+  explicit QueueEnv(unsigned malformedPerMille, bool writerOrder = false) {
     QueueRecipe recipe;
+    recipe.writerOrder = writerOrder;
     recipe.shareFull = root.AddShare("photo");
     recipe.folder = "2019";
     recipe.lines = kQueueLines;
@@ -50,6 +51,11 @@ QueueEnv& CleanQueue() {
 
 QueueEnv& DirtyQueue() {
   static QueueEnv env(10);
+  return env;
+}
+
+QueueEnv& WrittenQueue() {
+  static QueueEnv env(0, true);
   return env;
 }
 
@@ -204,6 +210,9 @@ void RegisterQueueBenchmarks() {
       benchmark::RegisterBenchmark("queue_scan_1pct_malformed/library", FolderStatusLibrary, &DirtyQueue));
   realTime(
       benchmark::RegisterBenchmark("queue_scan_1pct_malformed/baseline", FolderStatusBaseline, &DirtyQueue));
+  realTime(benchmark::RegisterBenchmark("queue_scan_as_written/library", FolderStatusLibrary, &WrittenQueue));
+  realTime(
+      benchmark::RegisterBenchmark("queue_scan_as_written/baseline", FolderStatusBaseline, &WrittenQueue));
   realTime(benchmark::RegisterBenchmark("pending_reindex/library", PendingReindexLibrary));
   realTime(benchmark::RegisterBenchmark("pending_reindex/baseline", PendingReindexBaseline));
   realTime(benchmark::RegisterBenchmark("read_file_only/reference", ReadFileOnly));

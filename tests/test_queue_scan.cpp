@@ -175,13 +175,21 @@ std::string CompactLine(std::mt19937_64& rng, const std::string& folder) {
       R"({"a":1,}|{"a" :1}|{"a":truex}|{"path":"/x","event":1}|{"a\u0062":1}|{"":"")");
   datas.push_back("{\"a\":\"" + std::string(rng() % 600, 'd') + "\"}");
   const std::string data = oneOf(datas);
-  std::string line = "{\"event\":" +
-                     oneOf({"2", "256", "65536", "0", "4294967295", "4294967296", "12345678901", "01", "-1",
-                            "1.5", "2e1", "9"}) +
-                     ",\"path\":" + path() +
-                     oneOf({"", "", ",\"path_old\":" + path(), ",\"data\":" + data, ",\"data\":" + data,
-                            ",\"data\":" + data + ",\"x\":1", ",\"path_old\":7", ",\"path\":" + path()}) +
-                     "}" + oneOf({"", "", "", " ", "\r", "x", "\0"s, "}"});
+  std::vector<std::string> members{"\"event\":" + oneOf({"2", "256", "65536", "0", "4294967295", "4294967296",
+                                                         "12345678901", "01", "-1", "1.5", "2e1", "9"}),
+                                   "\"path\":" + path()};
+  for (const std::string& more : Split(
+           oneOf({"", "", "\"path_old\":" + path(), "\"data\":" + data, "\"data\":" + data,
+                  "\"data\":" + data + "|\"x\":1", "\"path_old\":7", "\"path\":" + path(), "\"event\":1"}))) {
+    if (!more.empty()) members.push_back(more);
+  }
+  // The JSON library writes members in the order of their names; other writers keep their own.
+  const uint64_t order = rng() % 4;
+  if (order == 0) std::sort(members.begin(), members.end());
+  if (order == 1) std::shuffle(members.begin(), members.end(), rng);
+  std::string line = "{" + members[0];
+  for (size_t i = 1; i < members.size(); ++i) line += "," + members[i];
+  line += "}" + oneOf({"", "", "", " ", "\r", "x", "\0"s, "}"});
   if (rng() % 10 == 0) line.resize(rng() % (line.size() + 1));
   if (rng() % 10 == 0) line.insert(rng() % (line.size() + 1), 1, "\"\\{},:0 \t"[rng() % 10]);
   return line;

@@ -712,6 +712,8 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
   static const char kPath[] = ",\"path\":\"";
   static const char kPathOld[] = ",\"path_old\":\"";
   static const char kData[] = ",\"data\":";
+  static const char kDataFirst[] = "{\"data\":";
+  static const char kEventNext[] = ",\"event\":";
   // The masks must cover kSpan bytes from the line on (the line may lie past them).
   const ptrdiff_t span = static_cast<ptrdiff_t>(kSpan);
   if (line < window_ || windowEnd_ - line < span) {
@@ -752,9 +754,49 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
     return std::memcmp(p, "false", 5) == 0 ? p + 5 : nullptr;
   };
 
+  // The value of "data" from its first byte: a literal or a flat object of plain members
+  // (anything nested or escaped is left to the general reading); the position after it,
+  // or null.
+  auto data = [&](const char* p) -> const char* {
+    if (*p != '{') {
+      p = literal(p);
+    } else if (*++p == '}') {
+      ++p;
+    } else {
+      const char* stop;
+      for (;;) {
+        if (*p != '"' || (stop = stringEnd(p + 1)) == nullptr || stop[1] != ':') return nullptr;
+        p = stop + 2;
+        if (*p == '"') {
+          stop = stringEnd(p + 1);
+          p = stop == nullptr ? nullptr : stop + 1;
+        } else {
+          p = *p == '-' || IsDigit(*p) ? number(p) : literal(p);
+        }
+        if (p == nullptr || p >= limit) return nullptr;
+        if (*p != ',') break;
+        ++p;
+      }
+      if (*p != '}') return nullptr;
+      ++p;
+    }
+    return p != nullptr && p < limit ? p : nullptr;
+  };
+
+  // The members come in one of two orders: "event" first, as the queue format is
+  // documented, or in the order of their names ("data" first), as the JSON library
+  // writes them, which is how the notification daemon and the library's own events are
+  // written.
   const char* p = line;
-  if (!Equals(p, kEvent)) return false;
-  p += sizeof(kEvent) - 1;
+  const bool dataFirst = Equals(p, kDataFirst);
+  if (dataFirst) {
+    p = data(p + sizeof(kDataFirst) - 1);
+    if (p == nullptr || !Equals(p, kEventNext)) return false;
+    p += sizeof(kEventNext) - 1;
+  } else {
+    if (!Equals(p, kEvent)) return false;
+    p += sizeof(kEvent) - 1;
+  }
   const size_t digits = Digits16(p);
   if (digits == 0 || digits > 10 || (digits > 1 && *p == '0')) return false;
   uint64_t event = digits <= 8 ? EightDigits(p, digits)
@@ -784,37 +826,12 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
   if (*p == ',') {
     if (Equals(p, kPathOld)) {
       p = member(p + sizeof(kPathOld) - 1, out.pathOld, out.pathOldSize, out.pathOldStorage);
-      if (p == nullptr) return false;
-    } else if (Equals(p, kData)) {
-      p += sizeof(kData) - 1;
-      if (*p != '{') {
-        p = literal(p);
-      } else if (*++p == '}') {
-        ++p;
-      } else {
-        // A flat object of plain members; anything nested or escaped is left to the
-        // general reading.
-        const char* stop;
-        for (;;) {
-          if (*p != '"' || (stop = stringEnd(p + 1)) == nullptr || stop[1] != ':') return false;
-          p = stop + 2;
-          if (*p == '"') {
-            stop = stringEnd(p + 1);
-            p = stop == nullptr ? nullptr : stop + 1;
-          } else {
-            p = *p == '-' || IsDigit(*p) ? number(p) : literal(p);
-          }
-          if (p == nullptr || p >= limit) return false;
-          if (*p != ',') break;
-          ++p;
-        }
-        if (*p != '}') return false;
-        ++p;
-      }
-      if (p == nullptr || p >= limit) return false;
+    } else if (!dataFirst && Equals(p, kData)) {
+      p = data(p + sizeof(kData) - 1);
     } else {
       return false;
     }
+    if (p == nullptr) return false;
   }
   if (*p != '}' || p[1] != '\n') return false;
   out.event = static_cast<unsigned>(event);
