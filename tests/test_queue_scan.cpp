@@ -93,11 +93,20 @@ QueueLineKind ExpectSameReading(const std::string& line, size_t* valid = nullptr
   const QueueLineKind kind = internal::ClassifyQueueLine(line.data(), line.data() + line.size(), view, end);
   EXPECT_EQ(internal::ClassifyQueueLine(run.data(), run.data() + run.size(), inRun, runEnd), kind) << what;
   EXPECT_EQ(internal::ViewQueueLine(line.data(), line.size(), alone), kind == QueueLineKind::kEvent) << what;
+  // At the head of a run long enough for the run reader to read the line itself.
+  const std::string longRun = line + "\n" + std::string(1024, '\n');
+  internal::QueueEventView byRun;
+  const char* byRunEnd = nullptr;
+  EXPECT_EQ(internal::QueueRunClassifier(longRun.data(), longRun.data() + longRun.size())
+                .Classify(longRun.data(), byRun, byRunEnd),
+            kind)
+      << what;
   EXPECT_FALSE(kind == QueueLineKind::kNotEvent && ok) << "refused an event: " << what;
   if (valid) *valid += ok;
   if (kind != QueueLineKind::kEvent) return kind;
   EXPECT_TRUE(ok && end == line.data() + line.size() && runEnd == run.data() + line.size()) << what;
-  for (const internal::QueueEventView* v : {&view, &inRun, &alone}) {
+  EXPECT_EQ(byRunEnd, longRun.data() + line.size()) << what;
+  for (const internal::QueueEventView* v : {&view, &inRun, &alone, &byRun}) {
     EXPECT_EQ(v->event, n.event) << what;
     EXPECT_EQ(std::string(v->path, v->pathSize), n.path) << what;
     EXPECT_EQ(v->pathOld ? std::string(v->pathOld, v->pathOldSize) : "<none>", n.pathOld) << what;
@@ -129,6 +138,8 @@ TEST(QueueLineDifferential, HandPickedAndGeneratedLinesReadAsTheParserReadsThem)
       EXPECT_EQ(ExpectSameReading(line), group.first) << ::testing::PrintToString(line);
   const std::vector<std::string> seeds{
       R"({"event":2,"path":"/v/p/a","data":{}})",
+      R"({"data":{"inode":12,"size":0,"mtime":-1700000000},"event":2,"path":"/v/p/a"})",
+      R"({"event":8,"path":"/a","data":{"a":"s","b":true,"c":null,"d":false}})",
       R"( {"path" : "/v/p", "event" : 256 , "path_old":"/v/q/b", "data":[1,-2,true,null,"s\n\"\u00e9"]} )",
       R"({"event":4294967295,"path":"","path_old":7})",
       R"({"event":01,"path":"/a","data":"\ud800"})",
@@ -192,6 +203,7 @@ std::string CompactLine(std::mt19937_64& rng, const std::string& folder) {
   line += "}" + oneOf({"", "", "", " ", "\r", "x", "\0"s, "}"});
   if (rng() % 10 == 0) line.resize(rng() % (line.size() + 1));
   if (rng() % 10 == 0) line.insert(rng() % (line.size() + 1), 1, "\"\\{},:0 \t"[rng() % 10]);
+  if (rng() % 10 == 0 && !line.empty()) line.erase(rng() % line.size(), 1);
   return line;
 }
 
