@@ -271,8 +271,8 @@ class Reader {
   }
 
  private:
-  // The line exactly as the daemon and the library write it: "event" with a plain
-  // integer, "path" as a string, then at most one "path_old" string or one "data" value,
+  // The line in the queue format's documented order: "event" with a plain integer,
+  // "path" as a string, then at most one "path_old" string or one "data" value,
   // compact, and nothing after the object. Such a line reads the same here as in Root,
   // with fewer steps; false for any other line, which Root then reads.
   FIDX_HOT bool Canonical(QueueEventView& out, const char*& lineEnd) const {

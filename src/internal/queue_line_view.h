@@ -71,8 +71,9 @@ class QueueRunClassifier {
   // The masks cover this many 64-byte words from window_.
   static const size_t kWords = 128;
 
-  // True when the line is in the daemon's own compact form (escapes only in its paths),
-  // out then read; false leaves the line to ClassifyQueueLine.
+  // True when the line is compact, with "event" first or with its members in the order
+  // of their names (as the JSON library writes them), and escapes only in its paths; out
+  // is then read. False leaves the line to ClassifyQueueLine.
   bool Common(const char* line, QueueEventView& out, const char*& lineEnd);
   // Masks for the bytes from at on, as many words as the run has left.
   void Fill(const char* at);
