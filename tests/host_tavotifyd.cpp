@@ -1,36 +1,20 @@
 // tavotifyd end to end: the real binary over a temporary system root, watch lists written by
 // the host platform's MonitorQueue, and the queue read back with the consumers' line parser.
 #include <fcntl.h>
-#include <gtest/gtest.h>
-#include <signal.h>
 #include <sys/file.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <tavo/tavotifyd.h>
-#include <unistd.h>
-
-#include <chrono>
-#include <climits>
-#include <cstdlib>
-#include <filesystem>
-#include <fstream>
-#include <functional>
-#include <string>
-#include <thread>
-#include <vector>
 
 #include "host_support.h"
 #include "queue_events.h"
 
 namespace fs = std::filesystem;
-using fileindex_queue::QueueEvent;
+using namespace fileindex_queue;
+using host_test::ReadFile;
+using host_test::WriteFile;
 
 namespace {
 const std::string kDaemon = FILEINDEX_BINARY_DIR "/daemons/tavotifyd/tavotifyd";
-const int kMask = 65486;
-
-using host_test::ReadFile;
-using host_test::WriteFile;
 bool WaitUntil(const std::function<bool()>& done, int millis = 3000) {
   return host_test::WaitUntil(done, std::chrono::milliseconds(millis));
 }
@@ -40,9 +24,7 @@ class TavotifydTest : public ::testing::Test {
   void SetUp() override {
     char pattern[] = "/tmp/host_tavotifyd.XXXXXX";
     ASSERT_NE(::mkdtemp(pattern), nullptr);
-    char resolved[PATH_MAX];
-    ASSERT_NE(::realpath(pattern, resolved), nullptr);
-    root_ = resolved;
+    root_ = fs::canonical(pattern).string();
     share_ = root_ + "/volume1/share";
     queue_ = share_ + "/@eaDir/TAVO@file_index_queue";
     ::setenv("FILEINDEX_SYSROOT", root_.c_str(), 1);  // where MonitorQueue writes the lists
@@ -55,26 +37,22 @@ class TavotifydTest : public ::testing::Test {
     if (pid_ > 0) {
       EXPECT_EQ(Stop(), 0) << Log();
     }
-    if (pid_ > 0) {
-      ::kill(pid_, SIGKILL);
-      ::waitpid(pid_, nullptr, 0);
-    }
-    EXPECT_EQ(Log().find("Sanitizer"), std::string::npos) << Log();
-    EXPECT_EQ(Log().find("runtime error"), std::string::npos) << Log();
+    if (pid_ > 0) ::kill(pid_, SIGKILL), ::waitpid(pid_, nullptr, 0);
+    EXPECT_FALSE(Logged("Sanitizer")) << Log();
+    EXPECT_FALSE(Logged("runtime error")) << Log();
     ::unsetenv("FILEINDEX_SYSROOT");
     fs::remove_all(root_);
   }
-  // The list of queue_ through the platform's own writer; an empty folders list watches nothing.
+  // The list of queue_ through the platform's own writer; no folders watches nothing.
   void SetList(const std::vector<std::string>& folders) {
-    Json::Value config(Json::objectValue);
+    Json::Value config;
     config["queue"] = queue_;
     config["config"] = Json::Value(Json::arrayValue);
     for (const std::string& folder : folders) {
-      Json::Value entry;
+      Json::Value& entry = config["config"].append(Json::Value());
       entry["path"] = folder;
-      entry["mask"] = kMask;
+      entry["mask"] = 65486;
       entry["ignore"].append("@eaDir");
-      config["config"].append(entry);
     }
     ASSERT_EQ(TAVO::TAVOTIFYD::MonitorQueue::Upsert(TAVO::TAVOTIFYD::MonitorQueue(config), "fileindex",
                                                     TAVO::TAVOTIFYD::MONITOR_QUEUE_TYPE_FILE),
@@ -87,18 +65,16 @@ class TavotifydTest : public ::testing::Test {
     ASSERT_GE(pid_, 0);
     if (pid_ == 0) {
       int log = ::open((root_ + "/daemon.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
-      ::dup2(log, 1);
-      ::dup2(log, 2);
+      ::dup2(log, 1), ::dup2(log, 2);
       const std::string command = "exec " + wrapper + " \"$0\" --sysroot \"$1\" --foreground " + options;
       ::execl("/bin/sh", "sh", "-c", command.c_str(), kDaemon.c_str(), root_.c_str(), nullptr);
       ::_exit(127);
     }
-    ASSERT_TRUE(WaitUntil([&] { return Log().find("started:") != std::string::npos; }, 10000)) << Log();
-    // Folders listed before the start are reindexed once; the cases below look at what
-    // follows.
-    if (Log().find("watched before this start") != std::string::npos) {
+    ASSERT_TRUE(WaitUntil([&] { return Logged("started:"); }, 10000)) << Log();
+    // Folders listed before the start are reindexed once; the cases look at what follows.
+    if (Logged("watched before this start")) {
       ASSERT_TRUE(WaitUntil([&] { return !Events().empty(); }, 5000)) << Log();
-      for (const QueueEvent& event : Events()) EXPECT_EQ(event.code, 65536u) << event.path;
+      for (const QueueEvent& event : Events()) EXPECT_EQ(event.code, kReindex) << event.path;
       fs::remove(queue_);
     }
   }
@@ -111,15 +87,14 @@ class TavotifydTest : public ::testing::Test {
     return exited && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   }
   std::string Log() { return ReadFile(root_ + "/daemon.log"); }
+  bool Logged(const std::string& text) { return Log().find(text) != std::string::npos; }
+  // Read without the queue's lock, so a line being written may show in part: only whole lines count.
   std::vector<QueueEvent> Events() {
     std::vector<QueueEvent> events;
-    // Read without the queue's lock, so a line being written may show in part: only whole
-    // lines count.
     const std::string text = ReadFile(queue_);
-    for (size_t start = 0, end; (end = text.find('\n', start)) != std::string::npos; start = end + 1) {
-      EXPECT_TRUE(fileindex_queue::ParseQueueLine(text.data() + start, end - start, events.emplace_back()))
+    for (size_t start = 0, end; (end = text.find('\n', start)) != std::string::npos; start = end + 1)
+      EXPECT_TRUE(ParseQueueLine(text.data() + start, end - start, events.emplace_back()))
           << text.substr(start, end - start);
-    }
     return events;
   }
   size_t Count(std::uint32_t code, const std::string& path, const std::string& pathOld = "") {
@@ -130,9 +105,13 @@ class TavotifydTest : public ::testing::Test {
       count += event.code == code && event.path == path && event.pathOld == pathOld;
     return count;
   }
-  bool WaitFor(std::uint32_t code, const std::string& path, const std::string& pathOld = "",
-               int millis = 3000) {
-    return WaitUntil([&] { return Count(code, path, pathOld) > 0; }, millis);
+  bool WaitFor(std::uint32_t code, const std::string& path, int millis = 3000) {
+    return WaitUntil([&] { return Count(code, path) > 0; }, millis);
+  }
+  int LockQueue() {
+    int lock = ::open(queue_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+    EXPECT_EQ(::flock(lock, LOCK_EX), 0);
+    return lock;
   }
 
   std::string root_, share_, queue_;
@@ -140,12 +119,16 @@ class TavotifydTest : public ::testing::Test {
 };
 
 // Files created, written, changed and removed; IN_MODIFY is not a line; "@eaDir" is neither
-// watched nor reported; a single instance, and SIGTERM stops it cleanly.
-TEST_F(TavotifydTest, ReportsFileEventsOnceAndSkipsIgnoredNames) {
+// watched nor reported; a rename is one line; directories renamed or moved in keep being
+// followed under their new paths, a tree moved in is reported entry by entry, and a move
+// out is a deletion. A single instance, and SIGTERM stops it cleanly.
+TEST_F(TavotifydTest, ReportsFileEventsRenamesAndMovedTrees) {
+  fs::create_directories(share_ + "/docs/sub/deep");
+  WriteFile(root_ + "/outside/tree/deep/b", "b");
   SetList({share_});
   Start();
   // Changes made while no daemon watched are caught by reindexing what was listed before.
-  EXPECT_NE(Log().find("1 folders watched before this start are reindexed"), std::string::npos) << Log();
+  EXPECT_TRUE(Logged("1 folders watched before this start are reindexed")) << Log();
   EXPECT_EQ(ReadFile(root_ + "/var/run/tavotifyd.pid"), std::to_string(pid_) + "\n");
   int second = std::system((kDaemon + " --sysroot " + root_ + " 2>" + root_ + "/second.err").c_str());
   EXPECT_EQ(WEXITSTATUS(second), 1);
@@ -157,72 +140,59 @@ TEST_F(TavotifydTest, ReportsFileEventsOnceAndSkipsIgnoredNames) {
     std::ofstream out(file);
     for (int i = 0; i < 3; ++i) out << std::string(100000, 'x') << std::flush;  // several write()s
   }
-  fs::create_directories(share_ + "/docs/@eaDir/inner");
   WriteFile(share_ + "/docs/@eaDir/inner/thumb", "x");
   WriteFile(share_ + "/@eaDir/other", "x");
   ASSERT_EQ(::chmod(file.c_str(), 0600), 0);
   ASSERT_EQ(::unlink(file.c_str()), 0);
-  ASSERT_TRUE(WaitFor(fileindex_queue::kDeleted, file)) << ReadFile(queue_);
-  EXPECT_EQ(Count(fileindex_queue::kCreated, file), 1u);
-  EXPECT_EQ(Count(fileindex_queue::kModified, file), 1u);
-  EXPECT_EQ(Count(fileindex_queue::kAttributes, file), 1u);
-  EXPECT_EQ(Count(fileindex_queue::kDeleted, file), 1u);
-  EXPECT_EQ(ReadFile(queue_).find("@eaDir"), std::string::npos) << ReadFile(queue_);
-  EXPECT_EQ(Stop(), 0);
-  EXPECT_NE(Log().find("stopped"), std::string::npos) << Log();
-}
-
-// A rename is one line; directories renamed or moved in keep being followed under their new
-// paths, a tree moved in is reported entry by entry, and a move out is a deletion.
-TEST_F(TavotifydTest, RenamesAndMovedTrees) {
-  fs::create_directories(share_ + "/docs/sub/deep");
-  fs::create_directories(root_ + "/outside/tree/deep");
-  WriteFile(root_ + "/outside/tree/deep/b", "b");
-  SetList({share_});
-  Start();
-
   WriteFile(share_ + "/docs/old.txt", "x");
   fs::rename(share_ + "/docs/old.txt", share_ + "/docs/new.txt");
   fs::rename(share_ + "/docs/sub", share_ + "/moved");
   fs::rename(root_ + "/outside/tree", share_ + "/tree");
-  ASSERT_TRUE(WaitFor(fileindex_queue::kCreated, share_ + "/tree/deep/b")) << ReadFile(queue_);
+  ASSERT_TRUE(WaitFor(kCreated, share_ + "/tree/deep/b")) << ReadFile(queue_);
   WriteFile(share_ + "/moved/deep/c", "c");
   WriteFile(share_ + "/tree/deep/d", "d");
   fs::rename(share_ + "/docs/new.txt", root_ + "/outside/new.txt");
-  ASSERT_TRUE(WaitFor(fileindex_queue::kDeleted, share_ + "/docs/new.txt")) << ReadFile(queue_);
+  ASSERT_TRUE(WaitFor(kDeleted, share_ + "/docs/new.txt")) << ReadFile(queue_);
 
-  EXPECT_EQ(Count(fileindex_queue::kRenamed, share_ + "/docs/new.txt", share_ + "/docs/old.txt"), 1u);
-  EXPECT_EQ(Count(fileindex_queue::kDeleted, share_ + "/docs/old.txt"), 0u);
-  EXPECT_EQ(Count(fileindex_queue::kRenamed, share_ + "/moved", share_ + "/docs/sub"), 1u);
+  for (std::uint32_t code : {kCreated, kModified, kAttributes, kDeleted})
+    EXPECT_EQ(Count(code, file), 1u) << code;
+  EXPECT_EQ(Count(kRenamed, share_ + "/docs/new.txt", share_ + "/docs/old.txt"), 1u);
+  EXPECT_EQ(Count(kDeleted, share_ + "/docs/old.txt"), 0u);
+  EXPECT_EQ(Count(kRenamed, share_ + "/moved", share_ + "/docs/sub"), 1u);
   for (const char* path : {"/tree", "/tree/deep", "/tree/deep/b", "/moved/deep/c", "/tree/deep/d"})
-    EXPECT_GE(Count(fileindex_queue::kCreated, share_ + path), 1u) << path << "\n" << ReadFile(queue_);
-  EXPECT_EQ(ReadFile(queue_).find(share_ + "/docs/sub/deep/c"), std::string::npos) << "stale path";
+    EXPECT_GE(Count(kCreated, share_ + path), 1u) << path << "\n" << ReadFile(queue_);
+  const std::string queue = ReadFile(queue_);
+  EXPECT_EQ(queue.find(share_ + "/docs/sub/deep/c"), std::string::npos) << "stale path";
+  EXPECT_EQ(queue.find("@eaDir"), std::string::npos) << queue;
+  EXPECT_EQ(Stop(), 0);
+  EXPECT_TRUE(Logged("stopped")) << Log();
 }
 
 // Lists added, changed (a nested folder: still one line per event) and removed while running
 // take effect within a second.
 TEST_F(TavotifydTest, FollowsWatchListChanges) {
-  fs::create_directories(root_ + "/volume1/second");
+  const std::string second = root_ + "/volume1/second";
+  fs::create_directories(second);
   Start();
   SetList({share_});
   std::this_thread::sleep_for(std::chrono::seconds(1));
   WriteFile(share_ + "/docs/one", "1");
-  EXPECT_TRUE(WaitFor(fileindex_queue::kCreated, share_ + "/docs/one")) << Log();
+  EXPECT_TRUE(WaitFor(kCreated, share_ + "/docs/one")) << Log();
 
-  SetList({share_, share_ + "/docs", root_ + "/volume1/second"});
+  SetList({share_, share_ + "/docs", second});
   std::this_thread::sleep_for(std::chrono::seconds(1));
-  WriteFile(root_ + "/volume1/second/two", "2");
+  WriteFile(second + "/two", "2");
   WriteFile(share_ + "/docs/three", "3");
-  EXPECT_TRUE(WaitFor(fileindex_queue::kCreated, root_ + "/volume1/second/two")) << Log();
-  EXPECT_TRUE(WaitFor(fileindex_queue::kModified, share_ + "/docs/three"));
-  EXPECT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/three"), 1u);
+  EXPECT_TRUE(WaitFor(kCreated, second + "/two")) << Log();
+  EXPECT_TRUE(WaitFor(kModified, share_ + "/docs/three"));
+  EXPECT_EQ(Count(kCreated, share_ + "/docs/three"), 1u);
 
   ASSERT_EQ(
       TAVO::TAVOTIFYD::MonitorQueue::Delete(queue_, "fileindex", TAVO::TAVOTIFYD::MONITOR_QUEUE_TYPE_FILE),
       1);
   std::this_thread::sleep_for(std::chrono::seconds(1));
   WriteFile(share_ + "/docs/four", "4");
-  EXPECT_FALSE(WaitFor(fileindex_queue::kCreated, share_ + "/docs/four", "", 500)) << "still watched";
+  EXPECT_FALSE(WaitFor(kCreated, share_ + "/docs/four", 500)) << "still watched";
 }
 
 // While another holder keeps the queue locked nothing is written, and while the queue
@@ -231,43 +201,36 @@ TEST_F(TavotifydTest, FollowsWatchListChanges) {
 TEST_F(TavotifydTest, BusyOrFailingQueueLosesNothing) {
   SetList({share_});
   Start();
-  int lock = ::open(queue_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
-  ASSERT_GE(lock, 0);
-  ASSERT_EQ(::flock(lock, LOCK_EX), 0);
+  int lock = LockQueue();
   const int kFiles = 200;
   for (int i = 0; i < kFiles; ++i) WriteFile(share_ + "/docs/f" + std::to_string(i), "x");
   std::this_thread::sleep_for(std::chrono::milliseconds(700));
   EXPECT_EQ(ReadFile(queue_), "");
   ::close(lock);
-  ASSERT_TRUE(WaitFor(fileindex_queue::kModified, share_ + "/docs/f" + std::to_string(kFiles - 1)));
+  ASSERT_TRUE(WaitFor(kModified, share_ + "/docs/f" + std::to_string(kFiles - 1)));
   for (int i = 0; i < kFiles; ++i) {
-    ASSERT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/f" + std::to_string(i)), 1u) << i;
-    ASSERT_EQ(Count(fileindex_queue::kModified, share_ + "/docs/f" + std::to_string(i)), 1u) << i;
+    ASSERT_EQ(Count(kCreated, share_ + "/docs/f" + std::to_string(i)), 1u) << i;
+    ASSERT_EQ(Count(kModified, share_ + "/docs/f" + std::to_string(i)), 1u) << i;
   }
 
   fs::remove_all(share_ + "/@eaDir");
   WriteFile(share_ + "/docs/while-failing", "x");
-  ASSERT_TRUE(WaitUntil([&] {
-    return Log().find("No such file or directory; keeping") != std::string::npos;
-  })) << Log();
+  ASSERT_TRUE(WaitUntil([&] { return Logged("No such file or directory; keeping"); })) << Log();
   fs::create_directories(share_ + "/@eaDir");
-  EXPECT_TRUE(WaitFor(fileindex_queue::kModified, share_ + "/docs/while-failing"));
-  EXPECT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/while-failing"), 1u);
+  EXPECT_TRUE(WaitFor(kModified, share_ + "/docs/while-failing"));
+  EXPECT_EQ(Count(kCreated, share_ + "/docs/while-failing"), 1u);
 }
 
 // Past the bound on held lines, a queue's lines are replaced by a reindex of its folder.
 TEST_F(TavotifydTest, HeldLinesPastTheBoundBecomeAReindex) {
   SetList({share_});
   Start("", "--max-held-lines 50");
-  int lock = ::open(queue_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
-  ASSERT_GE(lock, 0);
-  ASSERT_EQ(::flock(lock, LOCK_EX), 0);
+  int lock = LockQueue();
   for (int i = 0; i < 100; ++i) WriteFile(share_ + "/docs/f" + std::to_string(i), "x");
-  ASSERT_TRUE(WaitUntil([&] { return Log().find("replacing them by 1 reindex lines") != std::string::npos; }))
-      << Log();
+  ASSERT_TRUE(WaitUntil([&] { return Logged("replacing them by 1 reindex lines"); })) << Log();
   ::close(lock);
-  ASSERT_TRUE(WaitFor(fileindex_queue::kReindex, share_));
-  EXPECT_EQ(Count(fileindex_queue::kCreated, share_ + "/docs/f99"), 0u);
+  ASSERT_TRUE(WaitFor(kReindex, share_));
+  EXPECT_EQ(Count(kCreated, share_ + "/docs/f99"), 0u);
   EXPECT_LE(Events().size(), 51u);
 }
 
@@ -279,17 +242,16 @@ TEST_F(TavotifydTest, QueueOverflowAsksForReindex) {
   SetList({share_});
   Start();
   ASSERT_EQ(::kill(pid_, SIGSTOP), 0);
-  // Two events a file (created, closed after writing).
-  for (int i = 0; i < maxQueued / 2 + 1000; ++i) {
+  for (int i = 0; i < maxQueued / 2 + 1000; ++i) {  // two events a file (created, closed after writing)
     int fd = ::open((share_ + "/docs/n" + std::to_string(i)).c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
     ASSERT_GE(fd, 0);
     ::close(fd);
   }
   ASSERT_EQ(::kill(pid_, SIGCONT), 0);
-  EXPECT_TRUE(WaitFor(fileindex_queue::kReindex, share_, "", 10000)) << Log();
-  EXPECT_NE(Log().find("max_queued_events"), std::string::npos) << Log();
+  EXPECT_TRUE(WaitFor(kReindex, share_, 10000)) << Log();
+  EXPECT_TRUE(Logged("max_queued_events")) << Log();
   WriteFile(share_ + "/docs/after", "x");
-  EXPECT_TRUE(WaitFor(fileindex_queue::kCreated, share_ + "/docs/after"));
+  EXPECT_TRUE(WaitFor(kCreated, share_ + "/docs/after"));
 }
 
 // Directories beyond the per-user watch limit (lowered in a user namespace of its own) are
@@ -304,8 +266,8 @@ TEST_F(TavotifydTest, WatchLimitAsksForReindex) {
   SetList({});
   Start("unshare -U -r sh -c '" + setLimit + " && exec \"$0\" \"$@\"'");
   SetList({share_});
-  EXPECT_TRUE(WaitFor(fileindex_queue::kReindex, share_)) << Log();
-  EXPECT_NE(Log().find("fs.inotify.max_user_watches"), std::string::npos) << Log();
+  EXPECT_TRUE(WaitFor(kReindex, share_)) << Log();
+  EXPECT_TRUE(Logged("fs.inotify.max_user_watches")) << Log();
 }
 
 }  // namespace

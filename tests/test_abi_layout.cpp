@@ -62,16 +62,13 @@ struct ProbeConfig : Config {
 
 }  // namespace
 
-TEST_F(LayoutTest, VirtualFunctionsKeepTheirSlots) {
+// Slots are fixed; virtual calls and the deleting destructor through the base reach the subclasses.
+TEST_F(LayoutTest, VirtualFunctionsKeepTheirSlotsAndDispatchThroughTheBase) {
   EXPECT_EQ(std::vector<std::ptrdiff_t>({VirtualSlot(&Config::Load), VirtualSlot(&Config::Save),
                                          VirtualSlot(&Config::GetLockPath), VirtualSlot(&Config::GetPath),
                                          VirtualSlot(&Folders::Load), VirtualSlot(&Status::Save),
                                          VirtualSlot(&Folders::GetLockPath), VirtualSlot(&Status::GetPath)}),
             std::vector<std::ptrdiff_t>({2, 3, 4, 5, 2, 3, 4, 5}));
-}
-
-// Virtual calls and the deleting destructor through the base reach the subclasses.
-TEST_F(LayoutTest, CallsThroughTheBaseReachTheSubclassesInSlotOrder) {
   std::unique_ptr<Config> folders(new Folders()), status(new Status());
   EXPECT_EQ(folders->GetPath() + "|" + folders->GetLockPath(), FolderConfPath() + "|" + Rooted("/tmp/fileidx_cfg_folder.lock"));
   EXPECT_EQ(status->GetPath() + "|" + status->GetLockPath(), StatusConfPath() + "|" + Rooted("/tmp/fileidx_cfg_status.lock"));

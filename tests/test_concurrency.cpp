@@ -14,7 +14,6 @@
 #include <cerrno>
 #include <cstdlib>
 #include <fstream>
-#include <functional>
 #include <random>
 #include <set>
 
@@ -28,33 +27,6 @@ namespace {
 const int kWriters = 4, kReaders = 2, kOpsPerWriter = 400;
 const char* const kShares[] = {"photo", "video"};
 
-// Forked children that never outlive the test: killed and reaped on every way out.
-struct Children {
-  std::vector<pid_t> pids;
-  ~Children() {
-    for (pid_t pid : pids)
-      if (pid > 0 && ::kill(pid, SIGKILL) == 0) ::waitpid(pid, nullptr, 0);
-  }
-  void Spawn(const int gate[2], const std::function<void()>& body) {
-    pid_t pid = ::fork();
-    if (pid == 0) {
-      ::prctl(PR_SET_PDEATHSIG, SIGKILL), ::alarm(90);
-      std::srand(static_cast<unsigned>(::getpid()));  // own lock back-off sleeps
-      ::close(gate[1]);
-      for (char c; ::read(gate[0], &c, 1) < 0 && errno == EINTR;) continue;
-      body();
-      ::_exit(0);
-    }
-    ASSERT_GT(pid, 0);
-    pids.push_back(pid);
-  }
-  int Wait(size_t i) {  // the wait status: 0 for a clean exit
-    int status = -1;
-    ::waitpid(pids[i], &status, 0);
-    return pids[i] = 0, status;
-  }
-};
-
 class ConcurrencyTest : public IndexMgrTest {
  protected:
   void SetUp() override {
@@ -65,28 +37,37 @@ class ConcurrencyTest : public IndexMgrTest {
       ::mkdir(Full(std::string("/") + share + "/base").c_str(), 0755);
     }
     // Folders nobody deletes: no share is ever cleaned up and readers always find something.
-    WriteFolders({Record("/photo/base", "base", true, true, true, true),
-                  Record("/video/base", "base", true, true, true, true)});
+    WriteFolders({Record("/photo/base", "base", 1, 1, 1, 1), Record("/video/base", "base", 1, 1, 1, 1)});
+  }
+  void TearDown() override {  // children never outlive the test, however it ends
+    for (pid_t pid : pids_)
+      if (pid > 0 && ::kill(pid, SIGKILL) == 0) ::waitpid(pid, nullptr, 0);
+    IndexMgrTest::TearDown();
+  }
+  int Wait(int i) {  // the child's wait status: 0 for a clean exit
+    int status = -1;
+    ::waitpid(pids_[i], &status, 0);
+    return pids_[i] = 0, status;
   }
   std::string ReportPath(const std::string& who) const { return Rooted("/report-" + who + ".json"); }
-  // Mixed calls on the writer's own folders, share flag and queue. The model records what
-  // each successful call left; a failed one must fail with code 9 and is taken as no change.
+
+  // Mixed calls on the writer's own folders, share flag and queue; the report records what each
+  // successful call left. A failure must carry code 9 (where a lock is taken) and changed nothing.
   void RunWriter(int writer) {
     std::mt19937 rng(1000 + writer);
     auto pick = [&rng](int n) { return static_cast<int>(rng() % static_cast<unsigned>(n)); };
     const std::string flagShare = "w" + std::to_string(writer);
     Json::Value report(Json::objectValue);
     for (int n = 0; n < kOpsPerWriter; ++n) {
-      const int k = pick(4);
+      const int k = pick(4), choice = pick(100);
       const std::string path = "/" + std::string(kShares[k % 2]) + "/" + flagShare + "-" + std::to_string(k);
-      const int choice = pick(100);
       bool ok = false, lockable = choice < 55 || choice >= 75;
       ErrorHandler::g_error_code = FILEINDEX_ERR_NONE;
       if (choice < 35) {
         const auto records =
             Array({Record(path, "n" + std::to_string(n), pick(2), pick(2), pick(2), pick(2))});
-        ok = pick(2) ? IndexMgr::Upsert(records) : IndexMgr::Set(records);
-        if (ok) report["folders"][path] = true;
+        if ((ok = pick(2) ? IndexMgr::Upsert(records) : IndexMgr::Set(records)))
+          report["folders"][path] = true;
       } else if (choice < 55) {
         if ((ok = IndexMgr::Delete(Array({Json::Value(path)})))) report["folders"][path] = false;
       } else if (choice < 75) {
@@ -101,13 +82,13 @@ class ConcurrencyTest : public IndexMgrTest {
     }
     std::ofstream(ReportPath(flagShare)) << internal::JsonToString(report);
   }
-  // Queries until told to stop; what readers see is only ever what a save left on disk.
+  // Queries until told to stop (or the child's alarm): readers only ever see what a save left.
   void RunReader(int reader) {
     Json::Value errors(Json::arrayValue);
     auto fail = [&errors](const std::string& what) {
       if (errors.size() < 20) errors.append(what + ": " + std::to_string(ErrorHandler::GetError()));
     };
-    while (!Exists(Rooted("/stop"))) {  // the child's alarm bounds it too
+    while (!Exists(Rooted("/stop"))) {
       ErrorHandler::g_error_code = FILEINDEX_ERR_NONE;
       for (const std::string& file : {FolderConfPath(), StatusConfPath()}) {
         Json::Value doc;
@@ -121,21 +102,32 @@ class ConcurrencyTest : public IndexMgrTest {
     }
     std::ofstream(ReportPath("r" + std::to_string(reader))) << internal::JsonToString(errors);
   }
+  std::vector<pid_t> pids_;
 };
 
 TEST_F(ConcurrencyTest, WritersAndReadersInSeveralProcesses) {
   // Children fork before the fake daemon's thread exists, then wait at a gate until it listens.
   int gate[2];
   ASSERT_EQ(::pipe2(gate, O_CLOEXEC), 0);
-  Children children;
-  for (int i = 0; i < kReaders + kWriters; ++i)
-    children.Spawn(gate, [&, i] { i < kReaders ? RunReader(i) : RunWriter(i - kReaders); });
+  for (int i = 0; i < kReaders + kWriters; ++i) {
+    pid_t pid = ::fork();
+    if (pid == 0) {
+      ::prctl(PR_SET_PDEATHSIG, SIGKILL), ::alarm(90);
+      std::srand(static_cast<unsigned>(::getpid()));  // own lock back-off sleeps
+      ::close(gate[1]);
+      for (char c; ::read(gate[0], &c, 1) < 0 && errno == EINTR;) continue;
+      i < kReaders ? RunReader(i) : RunWriter(i - kReaders);
+      ::_exit(0);
+    }
+    ASSERT_GT(pid, 0);
+    pids_.push_back(pid);
+  }
   StartDaemon();
   ::close(gate[1]), ::close(gate[0]);
-  for (int i = kReaders; i < kReaders + kWriters; ++i) EXPECT_EQ(children.Wait(i), 0) << "writer " << i;
+  for (int i = kReaders; i < kReaders + kWriters; ++i) EXPECT_EQ(Wait(i), 0) << "writer " << i;
   WriteFile(Rooted("/stop"), "");
   for (int i = 0; i < kReaders; ++i) {
-    EXPECT_EQ(children.Wait(i), 0) << "reader " << i;
+    EXPECT_EQ(Wait(i), 0) << "reader " << i;
     EXPECT_EQ(ReadJson(ReportPath("r" + std::to_string(i))), Json::Value(Json::arrayValue)) << "reader " << i;
   }
   // folder.conf and status.conf hold exactly what each writer's successful calls left.
@@ -152,7 +144,8 @@ TEST_F(ConcurrencyTest, WritersAndReadersInSeveralProcesses) {
   }
   EXPECT_EQ(FolderConf().getMemberNames(), std::vector<std::string>(expected.begin(), expected.end()));
   for (const char* share : kShares) {  // every queue line is one whole event
-    EXPECT_TRUE(ReadFile(Queue(share)).empty() || ReadFile(Queue(share)).back() == '\n') << share;
+    const std::string queue = ReadFile(Queue(share));
+    EXPECT_TRUE(queue.empty() || queue.back() == '\n') << share;
     for (const Json::Value& event : QueueEvents(share)) EXPECT_TRUE(event.isObject()) << event;
   }
 }

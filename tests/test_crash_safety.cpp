@@ -83,12 +83,10 @@ TEST_F(CrashSafetyTest, KilledSavesLeaveTheOldOrTheNewDocument) {
   std::mt19937 rng(7);
   long long folderGen = 2, statusGen = 2;  // what the files held after the last kill
   int kills = 0, midSave = 0;
-  // Up to 400 kills in 20 s; a slow machine (sanitizers, other tests running) goes on
-  // until it has made at least 40.
-  auto more = [&]() {
-    const auto elapsed = Clock::now() - t0;
-    return kills < 400 &&
-           (elapsed < std::chrono::seconds(20) || (kills < 40 && elapsed < std::chrono::seconds(90)));
+  // Up to 400 kills in 20 s; a slow machine (sanitizers, other tests) goes on to at least 40.
+  auto more = [&] {
+    const auto t = Clock::now() - t0;
+    return kills < 400 && (t < std::chrono::seconds(20) || (kills < 40 && t < std::chrono::seconds(90)));
   };
   for (t0 = Clock::now(); more(); ++kills) {
     progress[0] = progress[1] = -1;
@@ -100,8 +98,8 @@ TEST_F(CrashSafetyTest, KilledSavesLeaveTheOldOrTheNewDocument) {
     ASSERT_GE(pid, 0);
     ::usleep(static_cast<useconds_t>(rng() % window));
     ::kill(pid, SIGKILL);
-    int wstatus = 0;
-    ASSERT_TRUE(::waitpid(pid, &wstatus, 0) == pid && WIFSIGNALED(wstatus)) << "child ended: " << wstatus;
+    int ws = 0;
+    ASSERT_TRUE(::waitpid(pid, &ws, 0) == pid && WIFSIGNALED(ws)) << "child ended: " << ws;
     // Each generation saves folder.conf, then status.conf: a kill during one leaves each file
     // at its old or new generation, and status.conf never ahead of folder.conf.
     const long long started = progress[0], finished = progress[1];
@@ -131,7 +129,7 @@ TEST_F(CrashSafetyTest, FullDiskKeepsThePreviousDocumentAndNoTemporaryFile) {
   EXPECT_TRUE(folders.Load() && folders.Upsert(changes, Record("/photo/a", "a")) && folders.Save() &&
               status.Save());
   const std::string folderBefore = ReadFile(FolderConfPath()), statusBefore = ReadFile(StatusConfPath());
-  int filler = ::open((ConfDir() + "/filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+  const int filler = ::open((ConfDir() + "/filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
   while (::write(filler, std::string(4096, 'x').data(), 4096) > 0) continue;
   ::close(filler);
   Fill(folders, status);

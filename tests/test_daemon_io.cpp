@@ -46,9 +46,7 @@ extern "C" ssize_t write(int fd, const void* buf, size_t n) {
 extern "C" int setsockopt(int fd, int level, int name, const void* value, socklen_t len) noexcept {
   struct timeval tv = {-1, -1};
   if (level == SOL_SOCKET && name == SO_SNDTIMEO && len == sizeof(tv)) std::memcpy(&tv, value, len);
-  std::unique_lock<std::mutex> lock(spy::mu);
-  if (spy::active) spy::timeouts.push_back(tv);
-  lock.unlock();
+  if (std::lock_guard<std::mutex> lock(spy::mu); spy::active) spy::timeouts.push_back(tv);
   return static_cast<int>(::syscall(SYS_setsockopt, fd, level, name, value, len));
 }
 
@@ -68,28 +66,10 @@ std::string Frame(const std::string& type, const Json::Value& data) {
 class DaemonIoTest : public SysrootTest {
  protected:
   void SetUp() override {
-    SysrootTest::SetUp();
-    spy::active = true;
-    spy::writeSizes.clear(), spy::timeouts.clear();
+    SysrootTest::SetUp(), spy::active = true, spy::writeSizes.clear(), spy::timeouts.clear();
   }
   void TearDown() override { spy::active = false, SysrootTest::TearDown(); }
 };
-
-// One connection per command, its frame written in pieces of at most 1024 bytes after a 1 s
-// send timeout is set.
-TEST_F(DaemonIoTest, OneFramePerCommandInPiecesOfAtMost1024Bytes) {
-  FakeDaemon daemon;
-  ASSERT_TRUE(daemon.Start(SocketPath()));
-  Json::Value data;
-  data["path"] = "/volume1/photo/é", data["blob"] = std::string(2800, 'a');  // three pieces
-  ASSERT_TRUE(SendCammandToDaemon("upsert_folder_setting", data));
-  ASSERT_TRUE(SendCammandToDaemon("pause", Json::Value()));  // null data goes as JSON null
-  const std::string upsert = Frame("upsert_folder_setting", data), pause = Frame("pause", Json::Value());
-  EXPECT_EQ(daemon.RawFrames(), (std::vector<std::string>{upsert, pause}));
-  EXPECT_EQ(spy::writeSizes, (std::vector<size_t>{4, 1024, 1024, upsert.size() - 2052, 4, pause.size() - 4}));
-  ASSERT_EQ(spy::timeouts.size(), 2u);
-  EXPECT_TRUE(spy::timeouts[0].tv_sec == 1 && spy::timeouts[0].tv_usec == 0);
-}
 
 // No daemon (no socket file, or nobody listening): fails at once, quietly, without writing
 // or leaking a descriptor.
@@ -97,8 +77,7 @@ TEST_F(DaemonIoTest, NoListeningDaemonFailsAtOnceAndLeavesNoDescriptor) {
   const long before = OpenDescriptors();
   EXPECT_FALSE(SendCammandToDaemon("pause", Json::Value()));
   int stale = ::socket(AF_UNIX, SOCK_STREAM, 0);
-  struct sockaddr_un addr = {};
-  addr.sun_family = AF_UNIX;
+  struct sockaddr_un addr = {AF_UNIX, {}};
   std::strncpy(addr.sun_path, SocketPath().c_str(), sizeof(addr.sun_path) - 1);
   ASSERT_EQ(::bind(stale, reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)), 0);
   EXPECT_FALSE(SendCammandToDaemon("resume", Json::Value()));
@@ -108,14 +87,19 @@ TEST_F(DaemonIoTest, NoListeningDaemonFailsAtOnceAndLeavesNoDescriptor) {
   EXPECT_TRUE(logcap::Texts().empty() && ErrorHandler::GetError() == FILEINDEX_ERR_NONE);
 }
 
-// A write returning 0 is retried while errno is EINTR, three times at most, else ends it; one
-// "returning -1" is taken as a count: the piece is re-sent from one byte earlier.
-TEST_F(DaemonIoTest, WriteResultsDecideRetriesAndTheSocketIsClosed) {
+// One connection per command, a 1 s send timeout, pieces of at most 1024 bytes. A write returning 0 is
+// retried on EINTR three times at most; a -1 is taken as a count: the piece goes again from a byte earlier.
+TEST_F(DaemonIoTest, FramesGoInPiecesAndWriteResultsDecideRetries) {
   FakeDaemon daemon;
   ASSERT_TRUE(daemon.Start(SocketPath()));
   const long before = OpenDescriptors();
+  Json::Value big;
+  big["path"] = "/volume1/photo/é", big["blob"] = std::string(2800, 'a');  // three pieces
+  ASSERT_TRUE(SendCammandToDaemon("upsert_folder_setting", big));
+  const std::string first = Frame("upsert_folder_setting", big);
+  EXPECT_EQ(spy::writeSizes, (std::vector<size_t>{4, 1024, 1024, first.size() - 2052}));
   const std::pair<std::deque<std::pair<ssize_t, int>>, size_t> cases[] = {
-      {{{0, EINTR}, {0, EINTR}, {0, EINTR}}, 5},  // succeeds
+      {{{0, EINTR}, {0, EINTR}, {0, EINTR}}, 5},  // succeeds; null data goes as JSON null
       {{{0, EINTR}, {0, EINTR}, {0, EINTR}, {0, EINTR}}, 4},
       {{{0, EAGAIN}}, 1},
   };
@@ -126,13 +110,14 @@ TEST_F(DaemonIoTest, WriteResultsDecideRetriesAndTheSocketIsClosed) {
   }
   const Json::Value data(std::string(1500, 'b'));
   const std::string upsert = Frame("upsert_folder_setting", data);
-  spy::writeScript = {{4, 0}, {1024, 0}, {-1, EPIPE}};
-  spy::writeSizes.clear();
+  spy::writeScript = {{4, 0}, {1024, 0}, {-1, EPIPE}}, spy::writeSizes.clear();
   ASSERT_TRUE(SendCammandToDaemon("upsert_folder_setting", data));
   EXPECT_EQ(spy::writeSizes, (std::vector<size_t>{4, 1024, upsert.size() - 1028, upsert.size() - 1027}));
   // Every attempt connected once; scripted writes put nothing on the wire.
-  EXPECT_EQ(daemon.RawFrames(),
-            (std::vector<std::string>{Frame("resume", Json::Value()), "", "", upsert.substr(4 + 1023)}));
+  EXPECT_EQ(daemon.RawFrames(), (std::vector<std::string>{first, Frame("resume", Json::Value()), "", "",
+                                                          upsert.substr(4 + 1023)}));
+  ASSERT_EQ(spy::timeouts.size(), 5u);
+  for (const struct timeval& tv : spy::timeouts) EXPECT_TRUE(tv.tv_sec == 1 && tv.tv_usec == 0);
   EXPECT_EQ(OpenDescriptors(), before);
 }
 

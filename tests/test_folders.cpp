@@ -44,52 +44,19 @@ TEST_F(FoldersTest, RecordKeepsMistypedMembersAndTheLastWholeComponentMatchGover
   EXPECT_EQ(GetMostSuitableCfg({inner, sibling}, Rooted("/volume1/photo/a/bcd")), ParseJson("{}"));
 }
 
-// A non-object file is refused; flags without valid values carry over from the previous record.
-TEST_F(FoldersTest, LoadChecksShapeAndCarriesFlagsOver) {
+// A non-object file is refused; flags without valid values carry over from the previous record on
+// load and save; a delete reports flag changes keyed by path; listing a share matches its name exactly.
+TEST_F(FoldersTest, LoadSaveDeleteAndListByShare) {
   WriteFile(FolderConfPath(), "[1]");
   EXPECT_FALSE(folders_.Load());
   EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_MALFORMED_CONFIG);
   EXPECT_TRUE(logcap::Contains(" Malformed folders: [1]"));
-  Load(R"({"/photo/a": {"name": "a", "document": true, "audio": false, "video": true, "photo": false},
-           "/photo/b": {"video": "yes"}})");
-  ASSERT_TRUE(folders_.Save());
-  EXPECT_EQ(ReadJson(FolderConfPath())["/photo/b"], ParseJson(R"({"path": "/photo/b", "name": "",
-      "document": true, "audio": false, "video": true, "photo": false})"));
-}
-
-// Upsert returns the flags that changed (against the covering folder for a new one) and validates input.
-TEST_F(FoldersTest, UpsertReportsChangedFlagsAndValidatesInput) {
-  Load(R"({"/photo/2019": {"document": false, "audio": false, "video": true, "photo": true}})");
-  ASSERT_TRUE(folders_.Upsert(result_, ParseJson(R"({"path": "/photo/2019", "video": false})")));
-  EXPECT_EQ(result_, ParseJson(R"({"document":false,"audio":false,"video":true,"photo":false})"));
-  Json::Value request = ParseJson(R"({"path": "/photo/2019/x", "photo": true})");
-  ASSERT_TRUE(folders_.Upsert(result_, request));
-  EXPECT_EQ(result_, ParseJson(R"({"document":false,"audio":false,"video":false,"photo":false})"));
-  request["path"] = "/gone/x";
-  EXPECT_FALSE(folders_.Upsert(result_, request));
-  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_BAD_PARAM);
-  EXPECT_TRUE(logcap::Contains(" Bad param: {\"path\":\"/gone/x\",\"photo\":true}"));
-  EXPECT_FALSE(folders_.Get(result_, "/photo/2019/"));  // no trailing-slash normalisation
-  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_NO_SUCH_FOLDER);
-}
-
-// The 1001st folder is refused (updates still pass).
-TEST_F(FoldersTest, AThousandFoldersAtMost) {
-  Json::Value conf(Json::objectValue);
-  for (int i = 0; i < 999; ++i) conf["/photo/" + std::to_string(i)]["document"] = true;
-  Load(conf.toStyledString());
-  EXPECT_TRUE(folders_.Upsert(result_, ParseJson(R"({"path": "/photo/new1000"})")));
-  EXPECT_TRUE(folders_.Upsert(result_, ParseJson(R"({"path": "/photo/5"})")));
-  EXPECT_FALSE(folders_.Upsert(result_, ParseJson(R"({"path": "/photo/new1001"})")));
-  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_EXCEED_MAX_FOLDER);
-  EXPECT_TRUE(logcap::Contains(" Exceed max folder size"));
-}
-
-// Delete reports flag changes keyed by path; share membership for listing is the exact first component.
-TEST_F(FoldersTest, DeleteKeysTheFlagChangesByPathAndListMatchesTheWholeShareName) {
-  Load(R"({"/photo/a": {"document": true, "audio": false, "video": true, "photo": false},
-           "/photo/a/b": {"document": true, "audio": true, "video": false, "photo": false},
+  Load(R"({"/photo/a": {"name": "a", "document": true, "audio": false, "video": true, "photo": true},
+           "/photo/a/b": {"document": "yes", "audio": true, "video": false},
            "/photos/x": {}, "/Photo/z": {}})");
+  ASSERT_TRUE(folders_.Save());
+  EXPECT_EQ(ReadJson(FolderConfPath())["/photo/a/b"], ParseJson(R"({"path": "/photo/a/b", "name": "",
+      "document": true, "audio": true, "video": false, "photo": true})"));
   ASSERT_TRUE(folders_.Delete(result_, "/photo/a/b"));
   EXPECT_EQ(result_,
             ParseJson(R"({"/photo/a/b":{"document":false,"audio":true,"video":true,"photo":false}})"));
@@ -97,4 +64,28 @@ TEST_F(FoldersTest, DeleteKeysTheFlagChangesByPathAndListMatchesTheWholeShareNam
   ASSERT_TRUE(folders_.List(out, "photo"));
   ASSERT_EQ(out.size(), 1u);
   EXPECT_EQ(out[0].GetPath(), "/photo/a");
+}
+
+// Upsert returns the flags that changed (against the covering folder for a new one) and validates
+// input; the 1001st folder is refused while updates still pass.
+TEST_F(FoldersTest, UpsertReportsChangedFlagsAndValidatesInput) {
+  Json::Value conf(Json::objectValue);
+  for (int i = 0; i < 998; ++i) conf["/photo/" + std::to_string(i)]["document"] = true;
+  conf["/photo/2019"] = ParseJson(R"({"document": false, "audio": false, "video": true, "photo": true})");
+  Load(conf.toStyledString());
+  ASSERT_TRUE(folders_.Upsert(result_, ParseJson(R"({"path": "/photo/2019", "video": false})")));
+  EXPECT_EQ(result_, ParseJson(R"({"document":false,"audio":false,"video":true,"photo":false})"));
+  Json::Value request = ParseJson(R"({"path": "/photo/2019/x", "photo": true})");
+  ASSERT_TRUE(folders_.Upsert(result_, request));
+  EXPECT_EQ(result_, ParseJson(R"({"document":false,"audio":false,"video":false,"photo":false})"));
+  EXPECT_TRUE(folders_.Upsert(result_, ParseJson(R"({"path": "/photo/5"})")));
+  EXPECT_FALSE(folders_.Upsert(result_, ParseJson(R"({"path": "/photo/new1001"})")));
+  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_EXCEED_MAX_FOLDER);
+  EXPECT_TRUE(logcap::Contains(" Exceed max folder size"));
+  request["path"] = "/gone/x";
+  EXPECT_FALSE(folders_.Upsert(result_, request));
+  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_BAD_PARAM);
+  EXPECT_TRUE(logcap::Contains(" Bad param: {\"path\":\"/gone/x\",\"photo\":true}"));
+  EXPECT_FALSE(folders_.Get(result_, "/photo/2019/"));  // no trailing-slash normalisation
+  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_NO_SUCH_FOLDER);
 }

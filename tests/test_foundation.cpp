@@ -28,9 +28,7 @@ struct FileConfig : Config {
 
 class FoundationTest : public SysrootTest {
  protected:
-  FileConfig MakeConfig() {
-    return FileConfig(Rooted("/usr/tavo/etc/fileindex/test.conf"), Rooted("/tmp/test.lock"));
-  }
+  std::string ConfPath() const { return Rooted("/usr/tavo/etc/fileindex/test.conf"); }
 };
 
 }  // namespace
@@ -59,7 +57,7 @@ TEST_F(FoundationTest, ErrorCodeIsKeptAcrossSuccessAndLogLinesAreErrorsWhateverT
 // Contention (another open file holding flock) fails with code 9 and one log line; once
 // released the lock is taken. A missing lock directory fails at once with code 9 as well.
 TEST_F(FoundationTest, LockContentionAndMissingDirectoryFailWithCode9) {
-  FileConfig config = MakeConfig();
+  FileConfig config(ConfPath(), Rooted("/tmp/test.lock"));
   const int holder = ::open(config.GetLockPath().c_str(), O_RDWR | O_CREAT, 0644);
   ASSERT_EQ(::flock(holder, LOCK_EX), 0);
   EXPECT_FALSE(config.Lock(true));
@@ -70,7 +68,7 @@ TEST_F(FoundationTest, LockContentionAndMissingDirectoryFailWithCode9) {
   EXPECT_TRUE(config.Lock(true));
   config.Unlock();
   ErrorHandler::SetError(FILEINDEX_ERR_NONE);
-  FileConfig missing(Rooted("/usr/tavo/etc/fileindex/test.conf"), Rooted("/nodir/test.lock"));
+  FileConfig missing(ConfPath(), Rooted("/nodir/test.lock"));
   EXPECT_FALSE(missing.Lock(true));
   EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_LOCK);
 }
@@ -78,7 +76,7 @@ TEST_F(FoundationTest, LockContentionAndMissingDirectoryFailWithCode9) {
 // A missing file loads as empty; saves are compact, mode 0644 and load back. Empty or non-strict
 // files fail to load with code 6; saving into a missing directory, code 7.
 TEST_F(FoundationTest, LoadAndSaveRoundTripAndFailuresSetTheirCodes) {
-  FileConfig config = MakeConfig();
+  FileConfig config(ConfPath(), Rooted("/tmp/test.lock"));
   EXPECT_TRUE(config.Load());
   EXPECT_EQ(config.Document(), Json::Value(Json::objectValue));
   config.Document()["a"]["nested"] = "é";

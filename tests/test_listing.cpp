@@ -54,8 +54,9 @@ class ListingTest : public SysrootTest {
 };
 }  // namespace
 
-// Case-insensitive name order, paging, unsigned counters, and out-of-range pages.
-TEST_F(ListingTest, SortsAndPagesAscendingAndDescending) {
+// Case-insensitive name order, paging, unsigned counters, out-of-range pages; "photo" puts folders
+// without the flag first; other keys sort by path, ignoring case.
+TEST_F(ListingTest, SortsAndPages) {
   EXPECT_EQ(internal::JsonToString(List(7, 3)), R"({"folder":[],"offset":7,"total":0})");
   WriteFive();
   Json::Value all = List(0, 10);
@@ -73,11 +74,6 @@ TEST_F(ListingTest, SortsAndPagesAscendingAndDescending) {
     EXPECT_EQ(page["folder"], Json::Value(Json::arrayValue));
   }
   EXPECT_EQ(Col(List(4, ~0UL)), (Strings{"e"}));  // offset + limit must not overflow
-}
-
-// "photo" puts folders without the flag first; other keys sort by path, ignoring case.
-TEST_F(ListingTest, SortKeys) {
-  WriteFive();
   Strings byPhoto = Col(List(0, 10, "photo"));
   ASSERT_EQ(byPhoto.size(), 5u);
   std::sort(byPhoto.begin(), byPhoto.begin() + 3);  // order within each group is free
@@ -88,8 +84,9 @@ TEST_F(ListingTest, SortKeys) {
     EXPECT_EQ(Col(List(0, 10, key), "path"), (Strings{"/s/a", "/s/b", "/s/C", "/s/D"})) << key;
 }
 
-// "is_valid" and "status" are filled in and cost one file-system check each, for listed folders only.
-TEST_F(ListingTest, AdditionalFieldsAreComputedForThePageOnly) {
+// "is_valid" and "status" cost one file-system check each, for listed folders only; bad names and
+// parameters are logged and flagged but the record is kept; an unreadable configuration fails.
+TEST_F(ListingTest, AdditionalFieldsAndFailures) {
   WriteFive();
   const Json::Value names = ParseJson(R"(["is_valid","status"])");
   fake::Get().calls.clear();
@@ -98,14 +95,8 @@ TEST_F(ListingTest, AdditionalFieldsAreComputedForThePageOnly) {
   for (const Json::Value& folder : page["folder"])
     EXPECT_EQ(folder["additional"], ParseJson(R"({"is_valid":true,"status":"finished"})"));
   EXPECT_EQ(fake::CallsStartingWith("TAVOGetFSType(").size(), 4u);
-}
-
-// Unknown names and bad parameters are logged and flagged, but the record is always kept.
-TEST_F(ListingTest, BadAdditionalNamesNeverLoseTheRecord) {
-  WriteFolders({{"/s/a", "a", false}});
   Folder folder;
-  folder.Load("/s/a", ParseJson(R"({"name":"a"})"));
-  const Json::Value record = folder.asJson();
+  folder.Load("/s/1", ParseJson(R"({"name":"a"})"));
   Json::Value listed = folder.asJson(ParseJson(R"(["status","bogus"])"));
   EXPECT_EQ(listed["additional"], ParseJson(R"({"status":"finished","bogus":null})"));
   EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_BAD_PARAM);
@@ -115,16 +106,12 @@ TEST_F(ListingTest, BadAdditionalNamesNeverLoseTheRecord) {
   listed = folder.asJson(Json::Value(5));
   EXPECT_EQ(listed["additional"], Json::Value(Json::objectValue));
   listed.removeMember("additional");
-  EXPECT_EQ(listed, record);
+  EXPECT_EQ(listed, folder.asJson());
   EXPECT_EQ(logcap::Count("Bad param: 5"), 1);
   EXPECT_EQ(logcap::Count("GetAdditional failed"), 1);
-  // A bad element stops the loop and keeps what was added before it.
-  Json::Value out("x");
+  Json::Value out("x");  // a bad element stops the loop and keeps what was added before it
   EXPECT_FALSE(folder.GetAdditional(out, ParseJson(R"(["is_valid",{"a":1},"status"])")));
   EXPECT_EQ(out, ParseJson(R"({"is_valid":true})"));
-}
-
-TEST_F(ListingTest, UnreadableConfigurationFailsTheListing) {
   WriteFile(FolderConfPath(), "[]");
   Json::Value result("untouched");
   EXPECT_FALSE(IndexMgr::List(result, 0, 10, "name", "ASC", Json::Value(Json::arrayValue)));
@@ -132,9 +119,8 @@ TEST_F(ListingTest, UnreadableConfigurationFailsTheListing) {
   EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_MALFORMED_CONFIG);
 }
 
-// Guards that a page reading each queue and status.conf once gives every folder the
-// answer and the log lines (malformed queue lines once per folder that reads them, in
-// order) that reading them folder by folder gives, across generated queues and states.
+// A page reading each queue and status.conf once gives every folder the answer and the log lines
+// (malformed lines once per folder that reads them, in order) of reading them folder by folder.
 TEST_F(ListingTest, SharedReadsMatchFolderByFolderReads) {
   AddShare("t");
   std::vector<std::tuple<std::string, std::string, bool>> rows;
@@ -144,14 +130,14 @@ TEST_F(ListingTest, SharedReadsMatchFolderByFolderReads) {
   }
   WriteFolders(rows);
   const Json::Value names = ParseJson(R"(["status","is_valid"])");
-  const std::string full = Rooted("/volume1"), queueS = Queue("s"), queueT = Queue("t");
+  const std::string queueS = Queue("s"), queueT = Queue("t");
   ::mkdir(EaDir("s").c_str(), 0755), ::mkdir(EaDir("t").c_str(), 0755);
   std::mt19937 rng(5);
   auto queue = [&](const std::string& share, int lines) {
     std::string text;
     for (int i = 0; i < lines; ++i) {
       const std::string path =
-          full + "/" + share + "/d" + std::to_string(rng() % 12) + (rng() % 2 ? "/x" : "");
+          Full("/" + share + "/d" + std::to_string(rng() % 12) + (rng() % 2 ? "/x" : ""));
       const unsigned kind = rng() % 6;  // 0 and 2 are malformed
       text += kind == 1   ? "{\"event\":256,\"path\":\"/o\",\"path_old\":\"" + path + "\"}\n"
               : kind == 2 ? "{\"event\":\"2\",\"path\":\"" + path + "\"}\n"
@@ -160,7 +146,6 @@ TEST_F(ListingTest, SharedReadsMatchFolderByFolderReads) {
     return text;
   };
   size_t logged = 0, statuses = 0;
-  const std::string manyMalformed = std::string(20000, '!') + "\n";
   for (int round = 0; round < 12; ++round) {
     ::unlink(queueS.c_str()), ::unlink((queueS + ".tmp").c_str()), ::unlink(queueT.c_str());
     if (round % 3 != 2) WriteFile(queueS, queue("s", 1 + round));
@@ -168,14 +153,13 @@ TEST_F(ListingTest, SharedReadsMatchFolderByFolderReads) {
     if (round % 4 != 3) WriteFile(queueT, queue("t", 2 + round % 5));
     if (round == 5) {  // more malformed text than a page keeps
       std::string big;
-      for (int i = 0; i < 60; ++i) big += manyMalformed;
+      for (int i = 0; i < 60; ++i) big += std::string(20000, '!') + "\n";
       WriteFile(queueT, big + queue("t", 4));
     }
     const char* const conf[] = {R"({"resume_time":0})", R"({"no_space":{"t":true}})", "{oops", "{}"};
     WriteFile(StatusConfPath(), conf[round % 4]);
-    const std::string dir = round % 2 ? "DESC" : "ASC";
     logcap::Clear();
-    const Json::Value page = List(round % 5, 7 + round % 4, "name", dir, names);
+    const Json::Value page = List(round % 5, 7 + round % 4, "name", round % 2 ? "DESC" : "ASC", names);
     const Strings pageLog = logcap::Texts();
     // The reference: each listed folder's fields computed on their own, in page order.
     Folders config;
@@ -183,10 +167,9 @@ TEST_F(ListingTest, SharedReadsMatchFolderByFolderReads) {
     ASSERT_TRUE(config.Load() && config.List(folders));
     logcap::Clear();
     Json::Value alone(Json::arrayValue);
-    for (const Json::Value& listed : page["folder"]) {
+    for (const Json::Value& listed : page["folder"])
       for (const Folder& folder : folders)
         if (folder.GetPath() == listed["path"].asString()) alone.append(folder.asJson(names));
-    }
     EXPECT_EQ(page["folder"], alone) << "round " << round;
     EXPECT_EQ(pageLog, logcap::Texts()) << "round " << round;
     logged += pageLog.size();

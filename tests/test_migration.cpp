@@ -1,6 +1,7 @@
 // The one-time migration: services, Spotlight, watch lists and reindex events brought
 // into line with an existing folder.conf.
 #include <fileindex/utils.h>
+#include <gmock/gmock.h>
 #include <sys/stat.h>
 
 #include <string>
@@ -36,9 +37,8 @@ TEST_F(MigrationTest, WithoutFoldersOnlyStopsTheDaemon) {
   EXPECT_TRUE(fake::Get().monitorCalls.empty());
   fake::Get().forced["VLIBServiceStop"] = -1;
   EXPECT_FALSE(Updater_vem60_beta2());
-  ASSERT_EQ(logcap::Texts().size(), 1u);
-  EXPECT_NE(logcap::Texts()[0].find("utils:"), std::string::npos);
-  EXPECT_NE(logcap::Texts()[0].find("VLIBServiceStart failed: err=[0x3001 service.c:20]"), std::string::npos);
+  EXPECT_THAT(logcap::Texts(), testing::ElementsAre(testing::MatchesRegex(
+                                   R"(utils:[0-9]+ VLIBServiceStart failed: err=\[0x3001 service\.c:20\])")));
 }
 
 // Start, Spotlight (no Samba restart), one watch list per share, then reindex events in path order.
@@ -51,11 +51,10 @@ TEST_F(MigrationTest, RebuildsEachShareOnceAndReindexesEveryFolderInOrder) {
   ASSERT_EQ(fake::Get().monitorCalls.size(), 2u);
   EXPECT_EQ(fake::Get().monitorCalls[0].config["queue"].asString(), Queue("music"));
   EXPECT_EQ(fake::Get().monitorCalls[1].config["config"].size(), 2u);
-  const Strings photo = ReadLines(Queue("photo"));
-  ASSERT_EQ(photo.size(), 2u);
-  EXPECT_EQ(ParseJson(photo[0])["event"], Json::Value(65536));
-  EXPECT_EQ(ParseJson(photo[0])["path"].asString(), Rooted("/volume1/photo/a"));
-  EXPECT_EQ(ParseJson(photo[1])["path"].asString(), Rooted("/volume1/photo/b"));
+  Strings photo;
+  for (const std::string& line : ReadLines(Queue("photo")))
+    photo.push_back(ParseJson(line)["event"].asString() + " " + ParseJson(line)["path"].asString());
+  EXPECT_EQ(photo, (Strings{"65536 " + Full("/photo/a"), "65536 " + Full("/photo/b")}));
 }
 
 // Each failing step is logged and stops everything after it.

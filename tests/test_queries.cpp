@@ -1,4 +1,5 @@
-// Whether paths and shares are indexed, the folder list and one folder under the lock.
+// Whether paths and shares are indexed, the folder list and one folder under the lock; the fast
+// folder.conf reader against the strict parse.
 #include <fcntl.h>
 #include <fileindex/error.h>
 #include <fileindex/fileindex_c.h>
@@ -16,11 +17,12 @@
 #include "support/sysroot_test.h"
 
 using namespace TAVO::FILEINDEX;
+using Strings = std::vector<std::string>;
 
 namespace {
 class QueriesTest : public SysrootTest {
  protected:
-  void WriteFolders(const std::vector<std::string>& paths) {
+  void WriteFolders(const Strings& paths) {
     Json::Value conf(Json::objectValue);
     for (const std::string& path : paths) conf[path]["name"] = "n";
     WriteFile(FolderConfPath(), conf.toStyledString());
@@ -52,73 +54,62 @@ TEST_F(QueriesTest, PathTestsMatchWholeComponentsByteForByte) {
   EXPECT_EQ(logcap::Count(" Failed to get share name from path: "), 2);
 }
 
-// No file means no folders; a broken file fails every query rather than answering "not indexed".
-TEST_F(QueriesTest, AbsentConfigIsEmptyWhileABrokenOneFailsEveryQuery) {
+// No file means no folders; a broken file fails every query rather than answering "not indexed";
+// Get fails with a lock error while another holder has the lock, and releases it on every way out.
+TEST_F(QueriesTest, BrokenConfigFailsEveryQueryAndGetReleasesTheLock) {
   std::vector<Folder> folders(2);
   EXPECT_TRUE(IndexMgr::List(folders));
   EXPECT_TRUE(folders.empty());
   AddShare("video");
   WriteFile(FolderConfPath(), "{\"/video/movies\": {}");
   Json::Value result;
-  EXPECT_FALSE(IndexMgr::List(folders));
-  EXPECT_FALSE(IndexMgr::IsPathContainIndexed("/video"));
-  EXPECT_EQ(FILEIDXIsShareIndexed("video"), 0);
-  EXPECT_FALSE(IndexMgr::Get(result, "/video/movies"));
+  EXPECT_FALSE(IndexMgr::List(folders) || IndexMgr::IsPathContainIndexed("/video") ||
+               FILEIDXIsShareIndexed("video") != 0 || IndexMgr::Get(result, "/video/movies"));
   EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_LOAD_CONFIG);
-}
-
-// Get fails with a lock error while another holder has the lock, and releases it on every path.
-TEST_F(QueriesTest, GetTakesTheLockAndReleasesItOnEveryWayOut) {
-  AddShare("video");
+  WriteFile(FolderConfPath(), "[]");
+  EXPECT_FALSE(IndexMgr::Get(result, "/video/movies"));
   WriteFolders({"/video/movies"});
+  EXPECT_FALSE(IndexMgr::Get(result, "/video/other"));
+  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_NO_SUCH_FOLDER);
+  // Another open file, so the library's own flock conflicts; taken only if every call above let go.
   int fd = ::open(Rooted("/tmp/fileidx_cfg_folder.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-  ASSERT_EQ(::flock(fd, LOCK_EX), 0);  // another open file, so the library's own flock conflicts
-  Json::Value result;
+  ASSERT_EQ(::flock(fd, LOCK_EX | LOCK_NB), 0);
   EXPECT_FALSE(IndexMgr::Get(result, "/video/movies"));
   EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_LOCK);
   ::close(fd);
-  EXPECT_FALSE(IndexMgr::Get(result, "/video/other"));
-  EXPECT_EQ(ErrorHandler::GetError(), FILEINDEX_ERR_NO_SUCH_FOLDER);
   ASSERT_TRUE(IndexMgr::Get(result, "/video/movies"));
   EXPECT_EQ(result["path"], "/video/movies");
-  WriteFile(FolderConfPath(), "[]");
-  EXPECT_FALSE(IndexMgr::Get(result, "/video/movies"));
   Folders config;
-  EXPECT_TRUE(config.Lock(true));  // every call above let go of the lock
+  EXPECT_TRUE(config.Lock(true));
   config.Unlock();
 }
 
-// Each record as a folder is loaded from it: its path, then "name" when a string, then
-// each flag held as a boolean ("-" when not).
-std::vector<std::string> Described(const std::vector<internal::FolderConfRecord>& records) {
-  std::vector<std::string> out;
+// Each record as a folder is loaded from it: its path, then "name" when a string, then each flag
+// held as a boolean ("-" when not).
+Strings Described(const std::vector<internal::FolderConfRecord>& records) {
+  Strings out;
   for (const auto& r : records) {
-    std::string line(r.path.data, r.path.size);
-    line += r.name != nullptr ? "|" + std::string(r.name, r.nameSize) : "|-";
-    for (signed char flag : r.flags) line += flag < 0 ? "-" : std::to_string(flag);
-    out.push_back(line);
+    out.push_back(std::string(r.path.data, r.path.size) +
+                  (r.name ? "|" + std::string(r.name, r.nameSize) : "|-"));
+    for (signed char flag : r.flags) out.back() += flag < 0 ? "-" : std::to_string(flag);
   }
   return out;
 }
-
-std::vector<std::string> Described(const Json::Value& doc) {
-  std::vector<std::string> out;
+Strings Described(const Json::Value& doc) {
+  Strings out;
   for (auto it = doc.begin(); it != doc.end(); ++it) {
     const Json::Value& r = *it;
-    std::string line = it.name();
-    line += r.isObject() && r["name"].isString() ? "|" + r["name"].asString() : "|-";
+    out.push_back(it.name() + (r.isObject() && r["name"].isString() ? "|" + r["name"].asString() : "|-"));
     for (const char* flag : {"document", "audio", "video", "photo"})
-      line += !r.isObject() || !r[flag].isBool() ? "-" : r[flag].asBool() ? "1" : "0";
-    out.push_back(line);
+      out.back() += !r.isObject() || !r[flag].isBool() ? "-" : r[flag].asBool() ? "1" : "0";
   }
   return out;
 }
 
-// Guards the fast reader of folder.conf: wherever it decides a text, the strict parse
-// must read an object with exactly these records, in this order, holding these values.
-// Hand-picked texts plus every one-byte deletion and insertion of a delimiter into them.
+// Wherever the fast reader decides a text (seeds and their one-byte edits), the strict parse reads an
+// object with exactly these records, in this order, holding these values.
 TEST(FolderConfViewTest, AgreesWithTheStrictParseWhereverItDecides) {
-  const std::vector<std::string> seeds{
+  const Strings seeds{
       R"({"/a":{"audio":1,"name":null,"photo":true},"/b":"x","/c":{"document":false,"name":"plain","video":"true","x":{"name":"in","audio":true}}})",
       R"({"/d":{"audio":true,"audio":false},"/e":{"name":"a","name":"b"},"/f":{"name":"c","photo":false}})",
       R"({"/a/b":{"name":"x","document":true,"audio":false},"/a/c":{"name":"q\"\\\/\b\f\n\r\t\u00e9\ud83d\ude00"}})",
@@ -126,10 +117,10 @@ TEST(FolderConfViewTest, AgreesWithTheStrictParseWhereverItDecides) {
       R"({"/a":{},"/a/":{},"/b":[],"/b\u0000":{},"/\u00e9":{}, "/b":{}})",
       R"({"/x":{"d":123456789012345678,"e":1.5,"f":1e3,"g":01,"h":"\ud800\u0041","i":"\ud800"}})",
       "{\"/z\":{\"a\":{\"b\":{\"c\":[[[true]]]}}},\"/\xc3\xa9\xff\":{\"name\":\"\xe2\x82\xac\"}}"};
-  const std::vector<std::string> kInserted{
+  const Strings kInserted{
       "\"", "{", "}", "[",  "]",    ",",   ":",     "\\",  " ",         "0",
       "-",  "e", "/", "\n", "\x01", "\\u", "//x\n", "1.5", "\"/\":{},", std::string(1, '\0')};
-  std::vector<std::string> texts = seeds;
+  Strings texts = seeds;
   for (const std::string& s : seeds)
     for (size_t i = 0; i < s.size(); ++i) {
       texts.push_back(s.substr(0, i) + s.substr(i + 1));
@@ -143,28 +134,49 @@ TEST(FolderConfViewTest, AgreesWithTheStrictParseWhereverItDecides) {
     if (!internal::ViewFolderConf(text.data(), text.size(), records)) continue;
     ++decided;
     Json::Value parsed;
-    ASSERT_TRUE(internal::JsonFromString(parsed, text)) << text;
-    ASSERT_TRUE(parsed.isObject()) << text;
+    ASSERT_TRUE(internal::JsonFromString(parsed, text) && parsed.isObject()) << text;
     EXPECT_EQ(Described(records), Described(parsed)) << text;
   }
   EXPECT_GT(decided, 300);
-  // The forms the library itself writes are always decided.
-  for (const std::string& text : {seeds[0], seeds[3], seeds[6], std::string("{}")}) {
+  for (const std::string& text :
+       {seeds[0], seeds[3], seeds[6], std::string("{}")}) {  // forms the library writes
     std::vector<internal::FolderConfRecord> records;
     EXPECT_TRUE(internal::ViewFolderConf(text.data(), text.size(), records)) << text;
   }
 }
 
-// Guards that a query or a load answered through the fast reader gives the answer, the
-// folders, the log lines, the error code and the platform calls of one answered through
-// the strict parse: each folder.conf is asked once as written and once with its names
-// escaped ("\/"), which the fast reader leaves to the parse.
+// Answers, folders, log lines, error codes and platform calls are the same through the fast reader as
+// through the strict parse, which alone reads names escaped as "\/".
 TEST_F(QueriesTest, FastReaderMatchesTheFullLoad) {
   AddShare("video");
   AddShare("photo");
   std::mt19937 rng(3);
   const char* const shares[] = {"video", "photo", "gone"};
-  std::vector<Json::Value> confs;
+  const Strings probes{"/video", "/video/d1", "/video/d1/x", "/photo/d10", "/gone/d3/y", "/video/d", "", "/"};
+  auto ask = [&](const std::string& text) {
+    WriteFile(FolderConfPath(), text);
+    Strings seen;
+    for (const std::string& probe : probes) {
+      ErrorHandler::SetError(FILEINDEX_ERR_NONE);
+      logcap::Clear();
+      fake::Get().calls.clear();
+      seen.push_back(std::to_string(FILEIDXIsPathIndexed(probe.c_str())) +
+                     std::to_string(IndexMgr::IsPathContainIndexed(probe)) +
+                     std::to_string(FILEIDXIsFullPathIndexed(Rooted("/volume1" + probe).c_str())) +
+                     std::to_string(FILEIDXIsShareIndexed(probe.empty() ? "" : probe.substr(1).c_str())) +
+                     " " + std::to_string(ErrorHandler::GetError()));
+      for (const std::string& line : logcap::Texts()) seen.push_back(line);
+      seen.insert(seen.end(), fake::Get().calls.begin(), fake::Get().calls.end());
+    }
+    std::vector<Folder> folders;
+    seen.push_back(std::to_string(IndexMgr::List(folders)));
+    for (const Folder& f : folders)
+      seen.push_back(f.GetPath() + "|" + f.GetName() + "|" + f.GetFullPath() + "|" +
+                     std::to_string(f.IsDocument()) + std::to_string(f.IsAudio()) +
+                     std::to_string(f.IsVideo()) + std::to_string(f.IsPhoto()));
+    return seen;
+  };
+  int indexed = 0;
   for (int n : {0, 1, 5, 40}) {
     Json::Value conf(Json::objectValue);
     for (int i = 0; i < n; ++i) {
@@ -176,44 +188,13 @@ TEST_F(QueriesTest, FastReaderMatchesTheFullLoad) {
     }
     if (n == 5) conf[""]["name"] = "no share";
     if (n == 40) conf["/video"]["x"] = Json::Value(Json::arrayValue);
-    confs.push_back(conf);
-  }
-  const std::vector<std::string> probes{
-      "/video", "/video/d1", "/video/d1/x", "/photo/d10", "/gone/d3/y", "/video/d", "", "/"};
-  auto ask = [&](const std::string& text) {
-    WriteFile(FolderConfPath(), text);
-    std::vector<std::string> seen;
-    for (const std::string& probe : probes) {
-      ErrorHandler::SetError(FILEINDEX_ERR_NONE);
-      logcap::Clear();
-      fake::Get().calls.clear();
-      std::string answers =
-          std::to_string(FILEIDXIsPathIndexed(probe.c_str())) +
-          std::to_string(IndexMgr::IsPathContainIndexed(probe)) +
-          std::to_string(FILEIDXIsFullPathIndexed(Rooted("/volume1" + probe).c_str())) +
-          std::to_string(FILEIDXIsShareIndexed(probe.empty() ? "" : probe.substr(1).c_str()));
-      seen.push_back(answers + " " + std::to_string(ErrorHandler::GetError()));
-      for (const std::string& line : logcap::Texts()) seen.push_back(line);
-      for (const std::string& call : fake::Get().calls) seen.push_back(call);
-    }
-    std::vector<Folder> folders;
-    seen.push_back(std::to_string(IndexMgr::List(folders)));
-    for (const Folder& f : folders) {
-      seen.push_back(f.GetPath() + "|" + f.GetName() + "|" + f.GetFullPath() + "|" +
-                     std::to_string(f.IsDocument()) + std::to_string(f.IsAudio()) +
-                     std::to_string(f.IsVideo()) + std::to_string(f.IsPhoto()));
-    }
-    return seen;
-  };
-  int indexed = 0;
-  for (const Json::Value& conf : confs) {
     const std::string text = internal::JsonToString(conf);
     std::string escaped;
     for (char c : text) escaped += c == '/' ? std::string("\\/") : std::string(1, c);
     std::vector<internal::FolderConfRecord> records;
     ASSERT_TRUE(internal::ViewFolderConf(text.data(), text.size(), records)) << text;
     ASSERT_TRUE(conf.empty() || !internal::ViewFolderConf(escaped.data(), escaped.size(), records));
-    const std::vector<std::string> fast = ask(text);
+    const Strings fast = ask(text);
     EXPECT_EQ(fast, ask(escaped)) << text;
     for (const std::string& line : fast) indexed += line.compare(0, 2, "11") == 0;
   }

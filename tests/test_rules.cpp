@@ -17,7 +17,6 @@ namespace {
 class RulesTest : public SysrootTest {
  protected:
   static size_t Calls(const std::string& prefix) { return fake::CallsStartingWith(prefix).size(); }
-  static void ExpectRecordsFreed() { EXPECT_EQ(Calls("TAVOShareFree("), Calls("TAVOShareGet(")); }
   // One "Invaild Argument" line naming the failed check, 0xD00 raised at that line, no share lookup.
   static void ExpectBadArgument(int rc, const std::string& failed) {
     EXPECT_EQ(rc, -1) << failed;
@@ -30,9 +29,7 @@ class RulesTest : public SysrootTest {
     EXPECT_EQ(fake::Get().errCode, 0xD00);
     EXPECT_EQ(fake::Get().errFile + ":" + std::to_string(fake::Get().errLine), "utils:" + m[1].str());
     EXPECT_EQ(Calls("TAVOShareGet("), 0u);
-    fake::Get().calls.clear();
-    logcap::Clear();
-    fake::Get().errCode = 0;
+    fake::Get().calls.clear(), logcap::Clear(), fake::Get().errCode = 0;
   }
 };
 
@@ -47,8 +44,8 @@ TEST_F(RulesTest, SkipIndexPreservedNamesAndShareRulesApplyInOrder) {
   fake::Get().calls.clear();
   EXPECT_TRUE(IsSkipIndex(recycle) && IsSkipIndex(snapshot));
   EXPECT_EQ(Calls("VLIBFhsPathInSnapshot("), 1u) << "asked only for the path that is no recycle bin";
-  fake::Get().remoteFsTypes = {5};
-  for (int type : {-1, 5, 12, 3}) {
+  fake::Get().remoteFsTypes = {5}, fake::Get().imageFsTypes = {7};
+  for (int type : {-1, 5, 7, 12, 3}) {
     fake::Get().fsTypes["/v/p/a"] = type;
     fake::Get().calls.clear();
     EXPECT_EQ(IsSkipIndex("/v/p/a"), type != 3 && type != -1) << type;
@@ -58,7 +55,7 @@ TEST_F(RulesTest, SkipIndexPreservedNamesAndShareRulesApplyInOrder) {
     EXPECT_TRUE(IsSystemPreservedFileName(name)) << name;
   for (const char* name : {".ds_store", "", "TAVO@file_index_queue.tmp"})
     EXPECT_FALSE(IsSystemPreservedFileName(name)) << name;
-  // Shares: the name list is exact and checked before the platform; an encrypted share is refused.
+  // Shares: the name list is exact and checked before the platform; encrypted or read-only is refused.
   EXPECT_FALSE(CanShareBeIndexed(nullptr));
   char listed[] = "NetBackup", unlisted[] = "netbackup", empty[] = "";
   TAVOSHARE share;
@@ -70,6 +67,8 @@ TEST_F(RulesTest, SkipIndexPreservedNamesAndShareRulesApplyInOrder) {
   share.szName = unlisted;
   EXPECT_TRUE(CanShareBeIndexed(&share));
   share.blEncrypted = 1;
+  EXPECT_FALSE(CanShareBeIndexed(&share));
+  share.blEncrypted = 0, share.blReadOnly = 1;
   EXPECT_FALSE(CanShareBeIndexed(&share));
 }
 
@@ -137,7 +136,7 @@ TEST_F(RulesTest, LocationPathsAreInTheEaDirAndCutLikeSnprintf) {
             std::vector<std::string>{"TAVOEAMKDir(0," + eaDir + ")"});
   EXPECT_EQ(FILEIDXDBPathGet("photo", buffer, sizeof(buffer)), static_cast<int>(db.size()));
   EXPECT_TRUE(buffer == db && IsDirExist(db) && !Exists(queue));
-  ExpectRecordsFreed();
+  EXPECT_EQ(Calls("TAVOShareFree("), Calls("TAVOShareGet(")) << "every share record is freed";
   std::memset(buffer, 'x', sizeof(buffer));
   EXPECT_EQ(FILEIDXQueuePathGet("photo", buffer, 10), 9);
   EXPECT_EQ(std::string(buffer, 11), queue.substr(0, 9) + '\0' + 'x');

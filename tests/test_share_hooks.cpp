@@ -6,36 +6,32 @@
 #include "support/index_mgr_test.h"
 
 using namespace TAVO::FILEINDEX;
+using Strings = std::vector<std::string>;
 
 namespace {
 
 class ShareHooksTest : public IndexMgrTest {
  protected:
-  void SetUp() override {
-    IndexMgrTest::SetUp();
-    AddShare("photo");
-    AddShare("video");
-  }
+  void SetUp() override { IndexMgrTest::SetUp(), AddShare("photo"), AddShare("video"); }
 };
 
-// Guards that only the share's folders go, and that indexing stops with the last folder.
+// Only the share's folders go; indexing stops with the last folder.
 TEST_F(ShareHooksTest, RemoveForgetsTheShareAndStopsIndexingWithTheLastFolder) {
   StartDaemon();
   fake::Get().spotlight = true;
   WriteFolders({Record("/photo/a", "A", false, false, false, true),
                 Record("/video/v", "V", false, false, true, false)});
   ASSERT_TRUE(IndexMgr::ShareRemove("photo"));
-  EXPECT_EQ(FolderConf().getMemberNames(), (std::vector<std::string>{"/video/v"}));
+  EXPECT_EQ(FolderConf().getMemberNames(), (Strings{"/video/v"}));
   EXPECT_TRUE(SideEffectCalls().empty());
   ASSERT_TRUE(IndexMgr::ShareRemove("video"));
   EXPECT_EQ(FolderConf(), Json::Value(Json::objectValue));
-  EXPECT_EQ(SideEffectCalls(),
-            (std::vector<std::string>{"VLIBServiceStop(fileindexd,1)", "TAVOSMBIsEnableSpotlight()",
-                                      "TAVOSMBSetSpotlight(0)", "VLIBServiceRestart(samba)"}));
+  EXPECT_EQ(SideEffectCalls(), (Strings{"VLIBServiceStop(fileindexd,1)", "TAVOSMBIsEnableSpotlight()",
+                                        "TAVOSMBSetSpotlight(0)", "VLIBServiceRestart(samba)"}));
   EXPECT_TRUE(LockIsFree());
 }
 
-// Guards the path rewrite keeping settings, and that an unresolvable new name saves nothing.
+// The path rewrite keeps the settings; an unresolvable new name saves nothing.
 TEST_F(ShareHooksTest, RenameMovesFoldersAllOrNothing) {
   WriteFolders({Record("/video/a", "A", true, false, true, false),
                 Record("/photo/p", "P", false, false, false, true)});
@@ -46,19 +42,18 @@ TEST_F(ShareHooksTest, RenameMovesFoldersAllOrNothing) {
   fake::Get().shares.erase("video");  // the platform knows the new name only
   AddShare("movies");
   ASSERT_TRUE(IndexMgr::ShareRename("video", "movies"));
-  EXPECT_EQ(FolderConf().getMemberNames(), (std::vector<std::string>{"/movies/a", "/photo/p"}));
+  EXPECT_EQ(FolderConf().getMemberNames(), (Strings{"/movies/a", "/photo/p"}));
   EXPECT_EQ(FolderConf()["/movies/a"], Record("/movies/a", "A", true, false, true, false));
   EXPECT_TRUE(LockIsFree());
 }
 
-// Guards the daemon/watch-list order of pause and resume, and their failure paths.
+// Pause tells the daemon before dropping the watch list, resume after restoring it; their failures.
 TEST_F(ShareHooksTest, PauseTellsTheDaemonFirstAndResumeLast) {
   WriteFolders({Record("/photo/a", "A", false, false, false, true)});
   EXPECT_FALSE(IndexMgr::SharePause("photo"));  // the daemon is not listening
   EXPECT_TRUE(fake::Get().monitorCalls.empty());
   EXPECT_FALSE(IndexMgr::ShareResume("photo"));
   EXPECT_EQ(fake::Get().monitorCalls.size(), 1u);
-
   StartDaemon();
   fake::Get().monitorCalls.clear();
   ASSERT_TRUE(IndexMgr::SharePause("photo"));

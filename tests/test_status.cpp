@@ -8,32 +8,32 @@
 #include "support/sysroot_test.h"
 
 using namespace TAVO::FILEINDEX;
+using Strings = std::vector<std::string>;
 
 namespace {
 
 class StatusTest : public SysrootTest {
  protected:
-  void SetUp() override {
-    SysrootTest::SetUp();
-    fake::SetClock(1700000000);
-  }
+  void SetUp() override { SysrootTest::SetUp(), fake::SetClock(1700000000); }
   Json::Value Saved() { return ReadJson(StatusConfPath()); }
 };
 
-// Guards hours-to-time conversion (including the 32-bit wrap), bad input, the commands, and
-// that the save survives an absent daemon with the exact log lines and the lock freed.
+// Hours to time (with the 32-bit wrap), bad input, the commands, saves that survive an absent daemon
+// (exact log lines, lock freed); the pause time reads any number, unset as -1, and refuses other types.
 TEST_F(StatusTest, PauseStoresResumeTimeAndTellsDaemon) {
+  long long resume = 42;
+  ASSERT_TRUE(StatusMgr::GetPauseInfo(resume));
+  EXPECT_EQ(resume, -1);
   WriteFile(StatusConfPath(), R"({"no_space":{"photo":true,"video":true}})");
   EXPECT_FALSE(StatusMgr::Pause(1));
   EXPECT_EQ(Saved()["resume_time"].asInt64(), 1700003600);
   EXPECT_FALSE(StatusMgr::Resume());
   EXPECT_FALSE(StatusMgr::ShareRevive("photo"));
   EXPECT_EQ(Saved()["no_space"], ParseJson(R"({"video":true})"));
-  EXPECT_EQ(logcap::Texts(), (std::vector<std::string>{"status_mgr:198 SendCammandToDaemon failed",
-                                                       "status_mgr:221 SendCammandToDaemon failed",
-                                                       "status_mgr:321 SendCammandToDaemon failed"}));
+  EXPECT_EQ(logcap::Texts(),
+            (Strings{"status_mgr:198 SendCammandToDaemon failed", "status_mgr:221 SendCammandToDaemon failed",
+                     "status_mgr:321 SendCammandToDaemon failed"}));
   EXPECT_TRUE(StatusMgr::SetUpdated("k"));  // every failed call unlocked
-
   FakeDaemon daemon;
   ASSERT_TRUE(daemon.Start(SocketPath()));
   EXPECT_FALSE(StatusMgr::Pause(-1));
@@ -48,13 +48,6 @@ TEST_F(StatusTest, PauseStoresResumeTimeAndTellsDaemon) {
   ASSERT_EQ(sent.size(), 3u);
   EXPECT_EQ(sent[0], ParseJson(R"({"type":"pause","data":{"resume_time":1700007200}})"));
   EXPECT_EQ(sent[2], ParseJson(R"({"type":"resume","data":{}})"));
-}
-
-// Guards reading any number, the default when unset, and refusing other types.
-TEST_F(StatusTest, PauseInfoReadsAnyNumberAndRejectsOtherTypes) {
-  long long resume = 42;
-  ASSERT_TRUE(StatusMgr::GetPauseInfo(resume));
-  EXPECT_EQ(resume, -1);
   WriteFile(StatusConfPath(), R"({"resume_time":5.0})");
   ASSERT_TRUE(StatusMgr::GetPauseInfo(resume));
   EXPECT_EQ(resume, 5);
@@ -64,30 +57,31 @@ TEST_F(StatusTest, PauseInfoReadsAnyNumberAndRejectsOtherTypes) {
   EXPECT_TRUE(logcap::Contains(" json exception"));
 }
 
-// Guards the notifier's exact command, sent on first marking only; its failure is only logged.
-TEST_F(StatusTest, NoSpaceNotifiesOnFirstMarkingOnly) {
+// The notifier's exact command, sent on first marking only; its failure is only logged. Only the
+// quota errors 0x2900 and 0x2400 mean "short"; an unknown share fails.
+TEST_F(StatusTest, NoSpaceNotifiesOnceAndOnlyTwoQuotaErrorsMeanShort) {
   ASSERT_TRUE(StatusMgr::ShareSetNoSpace("photo", true));
   ASSERT_TRUE(StatusMgr::ShareSetNoSpace("photo", true));
   EXPECT_TRUE(StatusMgr::ShareIsNoSpace("photo"));
-  ASSERT_EQ(fake::Get().execs.size(), 1u);
-  EXPECT_EQ(fake::Get().execs[0],
-            (std::vector<std::string>{"/usr/tavo/bin/tavovemnotify", "-e", "false", "-c",
-                                      "TAVO.KOR.AdminCenter.Application", "@administrators",
-                                      "fileindex:fileindex_title", "fileindex:notify_no_space",
-                                      "<a data-tavo-app=\"TAVO.KOR.AdminCenter.Application\" "
-                                      "data-tavo-fn=\"TAVO.KOR.AdminCenter.MediaIndex.Main\" "
-                                      "data-tavo-tab=\"fileIndex\">", "</a>"}));
+  const Strings notify{"/usr/tavo/bin/tavovemnotify",
+                       "-e",
+                       "false",
+                       "-c",
+                       "TAVO.KOR.AdminCenter.Application",
+                       "@administrators",
+                       "fileindex:fileindex_title",
+                       "fileindex:notify_no_space",
+                       "<a data-tavo-app=\"TAVO.KOR.AdminCenter.Application\" "
+                       "data-tavo-fn=\"TAVO.KOR.AdminCenter.MediaIndex.Main\" data-tavo-tab=\"fileIndex\">",
+                       "</a>"};
+  EXPECT_EQ(fake::Get().execs, std::vector<Strings>{notify});
   fake::Get().execvResult = 1;
   ASSERT_TRUE(StatusMgr::ShareSetNoSpace("video", true));
   EXPECT_EQ(logcap::Count("NotifyNoSpace failed"), 1);
-}
-
-// Guards that only quota errors 0x2900 and 0x2400 mean "short", and the unknown-share failure.
-TEST_F(StatusTest, SpaceIsShortOnlyForTheTwoQuotaErrors) {
   const std::string dir = AddShare("photo").dir;
   EXPECT_TRUE(IsShareSpaceEnough("photo"));
   EXPECT_EQ(fake::CallsStartingWith("TAVOQuotaIsEnough"),
-            std::vector<std::string>{"TAVOQuotaIsEnough(0," + dir + ",10485760)"});
+            Strings{"TAVOQuotaIsEnough(0," + dir + ",10485760)"});
   fake::Get().quotaResult = 0;
   for (int code : {0x2900, 0x2400, 0x1234}) {
     fake::Get().quotaError = code;

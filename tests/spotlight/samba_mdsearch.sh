@@ -1,28 +1,21 @@
 #!/usr/bin/env bash
-# Finder's searches through a real Samba: a sandbox whose indexing daemon answers
-# Spotlight, smbd serving one of its shares, and mdsearch (Samba's Spotlight client)
-# asking what Finder asks. Everything runs in private network and process namespaces, so
-# the ports are the test's own and every daemon ends with it.
+# Finder's searches through a real Samba: a sandbox whose indexing daemon answers Spotlight,
+# smbd serving one of its shares, and mdsearch (Samba's Spotlight client) asking what Finder
+# asks, all in private network and process namespaces so that ports and daemons are the test's.
 #
 #   samba_mdsearch.sh BUILD_DIR     (as root; exit 77 when it cannot run here)
 set -euo pipefail
-
 build=$(cd "${1:?usage: $0 BUILD_DIR}" && pwd)
 ctl="$build/tools/fileindexctl/fileindexctl"
 self=$(readlink -f "$0")
 
 if [ "${2:-}" != --inside ]; then
-  if [ "$(id -u)" != 0 ]; then
-    echo "skipped: smbd and the namespaces need root"
-    exit 77
-  fi
+  [ "$(id -u)" = 0 ] || { echo "skipped: smbd and the namespaces need root"; exit 77; }
   for tool in smbd mdsearch smbpasswd unshare ip setpriv; do
     command -v "$tool" >/dev/null || { echo "missing $tool: install samba, smbclient, iproute2 (scripts/install-deps.sh)" >&2; exit 1; }
   done
-  if ! unshare --net --pid --fork --mount-proc true 2>/dev/null; then
-    echo "skipped: this machine does not allow private network and process namespaces"
-    exit 77
-  fi
+  unshare --net --pid --fork --mount-proc true 2>/dev/null ||
+    { echo "skipped: this machine does not allow private network and process namespaces"; exit 77; }
   exec timeout --kill-after=5 240 unshare --net --pid --fork --mount-proc "$self" "$build" --inside
 fi
 
@@ -32,10 +25,9 @@ chmod 755 "$work"
 source "$(dirname "$self")/../../scripts/samba-spotlight.sh"
 cleanup() {
   status=$?
-  if [ $status -ne 0 ]; then
-    echo "--- fileindexd.log"; tail -n 30 "$work/root/var/log/fileindexd.log" 2>/dev/null || true
-    echo "--- rpcd_mdssvc log"; tail -n 30 "$work/samba/log/log.rpcd_mdssvc" 2>/dev/null || true
-  fi
+  [ $status = 0 ] || for log in root/var/log/fileindexd.log samba/log/log.rpcd_mdssvc; do
+    echo "--- $log"; tail -n 30 "$work/$log" 2>/dev/null || true
+  done
   samba_cleanup
   rm -rf "$work"
   exit $status
@@ -50,15 +42,15 @@ share="$root/volume1/photo"
 mkfile() {  # path size date
   mkdir -p "$(dirname "$share/$1")"
   head -c "$2" /dev/zero >"$share/$1"
-  touch -d "$3" "$share/$1"
+  touch -d "$3 12:00 UTC" "$share/$1"
 }
-mkfile "2020/beach one.jpg" 20 "2021-06-01 12:00 UTC"
-mkfile "2020/Beach (1) copy.jpg" 5 "2019-05-01 12:00 UTC"
-mkfile "2020/beach notes.txt" 100 "2022-01-01 12:00 UTC"
-mkfile "2020/Café del Mar.flac" 15 "2020-07-01 12:00 UTC"
-mkfile "2020/sunset.png" 30 "2020-08-01 12:00 UTC"
-mkfile "2020/trips/beach walk.mp4" 12 "2020-09-01 12:00 UTC"
-mkfile "elsewhere/beach outside.jpg" 20 "2021-06-01 12:00 UTC"   # in no indexed folder
+mkfile "2020/beach one.jpg" 20 2021-06-01
+mkfile "2020/Beach (1) copy.jpg" 5 2019-05-01
+mkfile "2020/beach notes.txt" 100 2022-01-01
+mkfile "2020/Café del Mar.flac" 15 2020-07-01
+mkfile "2020/sunset.png" 30 2020-08-01
+mkfile "2020/trips/beach walk.mp4" 12 2020-09-01
+mkfile "elsewhere/beach outside.jpg" 20 2021-06-01  # in no indexed folder
 touch -d "2020-01-01 12:00 UTC" "$share/2020/city.jpg" "$share/2020/trips" "$share/2020"
 chmod -R a+rX "$root"
 fctl() { "$ctl" --sysroot "$root" --no-syslog "$@"; }
@@ -67,8 +59,7 @@ grep -q "spotlight backend = elasticsearch" "$root/etc/samba/smb.conf" ||
   fail "the library did not switch Spotlight on in smb.conf"
 
 samba_start "$work/samba" "$root" photo "$share"
-# mdsearch's own failures (a session Samba could not set up on a loaded machine) are
-# retried once, and reported with what mdsearch said.
+# mdsearch's own failures (a session Samba could not set up on a loaded machine) are retried once.
 search() {
   local out
   out=$(samba_search photo "$1") && { printf '%s\n' "$out"; return; }
@@ -76,11 +67,10 @@ search() {
   sleep 1
   samba_search photo "$1"
 }
-expect() {  # query, expected paths (one per line, sorted)
+expect() {  # query, expected paths
   local got
   got=$(search "$1") || fail "$1: mdsearch failed: $got"
-  [ "$got" = "$(printf '%s\n' "${@:2}" | sed '/^$/d' | sort)" ] ||
-    fail "$1: expected [${*:2}], got [$got]"
+  [ "$got" = "$(printf '%s\n' "${@:2}" | sed '/^$/d' | sort)" ] || fail "$1: expected [${*:2}], got [$got]"
   echo "ok: $1 -> $(echo "$got" | paste -sd '|')"
 }
 
@@ -105,16 +95,13 @@ expect 'kMDItemFSName=="beach (1)*"' "2020/Beach (1) copy.jpg"
 expect 'kMDItemDisplayName=="CAFÉ DEL*"' "$cafe"
 expect 'kMDItemFSName=="outside*"' ""
 
-# A new file is found within two seconds.
-mkfile "2020/lighthouse.jpg" 10 "2021-01-01 12:00 UTC"
+# A new file is found within two seconds, and searches are answered while indexing is paused.
+mkfile "2020/lighthouse.jpg" 10 2021-01-01
 start=$(date +%s%N)
 until [ "$(search 'kMDItemFSName=="lighthouse*"')" = "2020/lighthouse.jpg" ]; do
   [ $(( ($(date +%s%N) - start) / 1000000 )) -lt 2000 ] || fail "a new file was not found within 2 s"
   sleep 0.05
 done
-echo "ok: a new file found after $(( ($(date +%s%N) - start) / 1000000 )) ms"
-
-# Searches are answered while indexing is paused.
 fctl pause 1 >/dev/null
 expect 'kMDItemFSName=="lighthouse*"' "2020/lighthouse.jpg"
 fctl resume >/dev/null
@@ -133,6 +120,5 @@ echo "ok: root answered, another user refused"
 
 # The daemon ends cleanly, and under the sanitizers without a report.
 fctl sandbox stop >/dev/null
-if grep -E "runtime error|AddressSanitizer|LeakSanitizer" "$root/var/log/fileindexd.log"; then
+! grep -E "runtime error|AddressSanitizer|LeakSanitizer" "$root/var/log/fileindexd.log" ||
   fail "a sanitizer report in fileindexd's log"
-fi

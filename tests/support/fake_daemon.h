@@ -1,17 +1,7 @@
-// A stand-in for fileindexd in unit tests: listens on a UNIX socket in a background
-// thread and records every frame that arrives, one per connection.
-//
-// The library writes a frame, closes and returns without a reply. The fake accepts one
-// connection at a time, reads it to end of file, decodes and records it before it
-// accepts the next one, and Commands()/Frames()/RawFrames() first wait until no
-// connection is queued or being read. A connection that the sender's connect() has
-// completed is already queued, so right after a library call returns these accessors
-// include every command it sent:
-//
-//   FakeDaemon daemon;
-//   ASSERT_TRUE(daemon.Start(SocketPath()));
-//   ASSERT_TRUE(SendCammandToDaemon("pause", data));
-//   ASSERT_EQ(daemon.Commands().size(), 1u);
+// A stand-in for fileindexd: a background thread on a UNIX socket that records every frame,
+// one per connection. Connections are read one at a time, to end of file, and the accessors
+// first wait until none is queued or being read; since a sender's completed connect() is
+// already queued, they include every command a library call sent before it returned.
 #ifndef FILEINDEX_TESTS_FAKE_DAEMON_H
 #define FILEINDEX_TESTS_FAKE_DAEMON_H
 
@@ -28,36 +18,28 @@
 class FakeDaemon {
  public:
   FakeDaemon() = default;
-  ~FakeDaemon();
+  ~FakeDaemon() { Stop(); }
   FakeDaemon(const FakeDaemon&) = delete;
   FakeDaemon& operator=(const FakeDaemon&) = delete;
 
-  // Binds and listens on socketPath (a stale socket file there is removed first) and
-  // starts serving. False when the socket cannot be made or the fake already runs.
+  // Listens on socketPath (replacing a stale socket); false when that fails or already running.
   bool Start(const std::string& socketPath);
-  // Stops serving, closes the socket and removes its file. Safe to call twice.
-  void Stop();
+  void Stop();  // closes and removes the socket; safe to call twice
 
-  // The decoded command objects, in arrival order; frames that did not decode are left out.
-  std::vector<Json::Value> Commands();
-  // Every connection's bytes as received (length prefix included), in arrival order.
-  std::vector<std::string> RawFrames();
-  // Forgets what was recorded (the benchmarks reuse one daemon between runs).
-  void Clear();
-
+  std::vector<Json::Value> Commands();   // decoded commands in arrival order, undecodable left out
+  std::vector<std::string> RawFrames();  // every connection's bytes, length prefix included
+  void Clear();                          // forgets what was recorded
   const std::string& SocketPath() const { return path_; }
 
  private:
   void Serve();
-  // With mu_ held: waits until nothing is queued on the socket nor being read.
-  void SettleLocked(std::unique_lock<std::mutex>& lock);
-  bool ConnectionQueued() const;
+  // Waits (up to 5 s) until nothing is queued nor being read; the frames, forgotten when clear.
+  std::vector<fileindex_frame::DecodedFrame> Settled(bool clear);
 
   std::string path_;
   int listenFd_ = -1;
   int wakePipe_[2] = {-1, -1};
   std::thread thread_;
-
   std::mutex mu_;
   std::condition_variable cv_;
   bool busy_ = false;

@@ -14,29 +14,19 @@ namespace {
 std::mutex g_mutex;
 std::vector<Line>* g_lines = new std::vector<Line>();
 
-// syslog expands %m itself; do the same before formatting.
-std::string ExpandErrno(const char* fmt, int savedErrno) {
-  std::string out;
+void Capture(int priority, const char* fmt, va_list ap) {
+  const int savedErrno = errno;
+  std::string format;  // syslog expands %m itself: do the same before formatting
   for (const char* p = fmt; *p; ++p) {
-    if (p[0] == '%' && p[1] == '%') {
-      out += "%%";
-      ++p;
-    } else if (p[0] == '%' && p[1] == 'm') {
-      for (const char* e = std::strerror(savedErrno); *e; ++e) {
-        if (*e == '%') out += '%';
-        out += *e;
-      }
+    if (p[0] == '%' && p[1] == 'm') {
+      for (const char* e = std::strerror(savedErrno); *e; ++e)
+        format += *e == '%' ? "%%" : std::string(1, *e);
       ++p;
     } else {
-      out += *p;
+      format += *p;
+      if (p[0] == '%' && p[1] == '%') format += *++p;
     }
   }
-  return out;
-}
-
-void Capture(int priority, const char* fmt, va_list ap) {
-  int savedErrno = errno;
-  std::string format = ExpandErrno(fmt, savedErrno);
   char buffer[16384];
   std::vsnprintf(buffer, sizeof(buffer), format.c_str(), ap);
   std::lock_guard<std::mutex> guard(g_mutex);
@@ -62,9 +52,7 @@ bool Contains(const std::string& fragment) { return Count(fragment) > 0; }
 
 int Count(const std::string& fragment) {
   int n = 0;
-  for (const Line& line : *g_lines) {
-    if (line.text.find(fragment) != std::string::npos) ++n;
-  }
+  for (const Line& line : *g_lines) n += line.text.find(fragment) != std::string::npos;
   return n;
 }
 
@@ -73,6 +61,7 @@ int Count(const std::string& fragment) {
 extern "C" {
 
 void vsyslog(int priority, const char* fmt, va_list ap) { logcap::Capture(priority, fmt, ap); }
+void __vsyslog_chk(int priority, int, const char* fmt, va_list ap) { logcap::Capture(priority, fmt, ap); }
 
 void syslog(int priority, const char* fmt, ...) {
   va_list ap;
@@ -80,8 +69,6 @@ void syslog(int priority, const char* fmt, ...) {
   logcap::Capture(priority, fmt, ap);
   va_end(ap);
 }
-
-void __vsyslog_chk(int priority, int, const char* fmt, va_list ap) { logcap::Capture(priority, fmt, ap); }
 
 void __syslog_chk(int priority, int, const char* fmt, ...) {
   va_list ap;

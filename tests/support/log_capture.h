@@ -15,10 +15,8 @@ struct Line {
 const std::vector<Line>& Lines();
 std::vector<std::string> Texts();
 void Clear();
-// Whether some captured line contains the fragment.
-bool Contains(const std::string& fragment);
-// How many captured lines contain the fragment.
-int Count(const std::string& fragment);
+bool Contains(const std::string& fragment);  // whether some line contains the fragment
+int Count(const std::string& fragment);      // how many lines contain it
 
 }  // namespace logcap
 

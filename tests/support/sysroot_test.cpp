@@ -23,15 +23,10 @@ void SysrootTest::SetUp() {
 }
 
 void SysrootTest::TearDown() {
-  if (!root_.empty() && root_.compare(0, 20, "/tmp/fileindex-test-") == 0) {
-    std::string cmd = "rm -rf '" + root_ + "'";
-    if (std::system(cmd.c_str()) != 0) ADD_FAILURE() << "cannot remove " << root_;
-  }
+  if (root_.compare(0, 20, "/tmp/fileindex-test-") == 0 &&
+      std::system(("rm -rf '" + root_ + "'").c_str()) != 0)
+    ADD_FAILURE() << "cannot remove " << root_;
   ::unsetenv("FILEINDEX_SYSROOT");
-}
-
-fake::Share& SysrootTest::AddShare(const std::string& name, const std::string& volume) {
-  return fake::AddShare(root_, volume, name);
 }
 
 void SysrootTest::WriteFile(const std::string& path, const std::string& content) {
@@ -41,9 +36,8 @@ void SysrootTest::WriteFile(const std::string& path, const std::string& content)
 }
 
 std::string SysrootTest::ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
   std::stringstream text;
-  text << in.rdbuf();
+  text << std::ifstream(path, std::ios::binary).rdbuf();
   return text.str();
 }
 
@@ -53,8 +47,7 @@ bool SysrootTest::Exists(const std::string& path) {
 }
 
 Json::Value SysrootTest::ParseJson(const std::string& text) {
-  Json::CharReaderBuilder builder;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  std::unique_ptr<Json::CharReader> reader(Json::CharReaderBuilder().newCharReader());
   Json::Value value;
   std::string errors;
   EXPECT_TRUE(reader->parse(text.data(), text.data() + text.size(), &value, &errors))
@@ -62,12 +55,9 @@ Json::Value SysrootTest::ParseJson(const std::string& text) {
   return value;
 }
 
-Json::Value SysrootTest::ReadJson(const std::string& path) { return ParseJson(ReadFile(path)); }
-
 std::vector<std::string> SysrootTest::ReadLines(const std::string& path) {
   std::vector<std::string> lines;
   std::ifstream in(path);
-  std::string line;
-  while (std::getline(in, line)) lines.push_back(line);
+  for (std::string line; std::getline(in, line);) lines.push_back(line);
   return lines;
 }

@@ -1,8 +1,8 @@
 // Files of each kind the extraction worker reads, made on the spot with the libraries of
 // their formats (and a PDF and zip documents written by hand), plus hostile ones: for the
-// service test and the benchmark.
-#ifndef FILEINDEX_TESTS_CONTENT_SAMPLES_H
-#define FILEINDEX_TESTS_CONTENT_SAMPLES_H
+// sample maker, the service test and the benchmark.
+#ifndef FILEINDEX_SAMPLES_CONTENT_SAMPLES_H
+#define FILEINDEX_SAMPLES_CONTENT_SAMPLES_H
 
 #include <taglib/fileref.h>
 #include <taglib/opusfile.h>
@@ -12,6 +12,7 @@
 #include <algorithm>
 #include <cstdint>
 #include <exiv2/exiv2.hpp>
+#include <filesystem>
 #include <fstream>
 #include <memory>
 #include <string>
@@ -107,12 +108,8 @@ struct Tags {
 
 // MPEG-1 layer III frames of silence (128 kbit/s, 44.1 kHz): about `seconds` long.
 inline std::string Mp3Frames(double seconds) {
-  const std::size_t frameSize = 417;  // 144 * 128000 / 44100
-  std::string frame(frameSize, '\0');
-  frame[0] = '\xFF';
-  frame[1] = '\xFB';
-  frame[2] = '\x90';
-  frame[3] = '\x64';
+  const std::string frame =
+      std::string("\xFF\xFB\x90\x64", 4) + std::string(417 - 4, '\0');  // 144 * 128000 / 44100
   std::string out;
   for (int i = 0; i < static_cast<int>(seconds * 44100 / 1152); ++i) out += frame;
   return out;
@@ -203,14 +200,11 @@ inline std::string OggOpus(double seconds) {
   return out;
 }
 
-inline bool EndsWith(const std::string& text, const std::string& end) {
-  return text.size() >= end.size() && text.compare(text.size() - end.size(), end.size(), end) == 0;
-}
-
 // An MP3, FLAC or Ogg Opus (.ogg, .opus) file, by its extension, with tags written by TagLib.
 inline bool WriteAudio(const std::string& path, const Tags& tags, double seconds = 3) {
-  const bool opus = EndsWith(path, ".ogg") || EndsWith(path, ".opus");
-  Write(path, EndsWith(path, ".flac") ? FlacHeader(seconds) : opus ? OggOpus(seconds) : Mp3Frames(seconds));
+  const std::string extension = std::filesystem::path(path).extension();
+  const bool opus = extension == ".ogg" || extension == ".opus";
+  Write(path, extension == ".flac" ? FlacHeader(seconds) : opus ? OggOpus(seconds) : Mp3Frames(seconds));
   std::unique_ptr<TagLib::File> opened;
   if (opus) opened.reset(new TagLib::Ogg::Opus::File(path.c_str()));
   TagLib::FileRef file = opened ? TagLib::FileRef(opened.release()) : TagLib::FileRef(path.c_str());
@@ -274,7 +268,6 @@ inline std::string Pdf(const std::vector<std::string>& pages, const std::string&
     objects.push_back("<< /Length " + std::to_string(stream.size()) + " >>\nstream\n" + stream +
                       "\nendstream");
   }
-  std::string info;
   if (!title.empty()) objects.push_back("<< /Title (" + title + ") >>");
   std::string out = "%PDF-1.4\n";
   std::vector<std::size_t> offsets;
