@@ -1,7 +1,6 @@
 // What is inside the files, end to end: fileindexd and its extraction worker on files of each
 // kind made by the formats' own libraries, searched by their fields through fileindexctl;
 // and hostile files, each recorded as failed within its time limit while the service goes on.
-#include <sqlite3.h>
 #include <zlib.h>
 
 #include <map>
@@ -67,106 +66,70 @@ class ContentTest : public SandboxTest {
     return ParseJson(Run({"--json", "why", name[0] == '/' ? name : kAt + name}).out);
   }
   // Waits until none of these files of the folder has its contents pending.
-  ::testing::AssertionResult WaitExtracted(const std::vector<std::string>& names) {
-    std::string last;
+  bool WaitExtracted(const std::vector<std::string>& names) {
     auto done = [&] {
       for (const std::string& name : names) {
-        Json::Value why = Why(name);
-        if (why["state"] == "pending" || why["state"] == "content-pending" || why.isNull()) {
-          last = name + ": " + why.toStyledString();
-          return false;
-        }
+        const Json::Value why = Why(name);
+        if (why.isNull() || why["state"] == "pending" || why["state"] == "content-pending") return false;
       }
       return true;
     };
-    if (WaitUntil(done, kDeadline)) return ::testing::AssertionSuccess();
-    return ::testing::AssertionFailure() << "still pending: " << last << "\ndaemon log:\n" << Log();
+    return WaitUntil(done, kDeadline);
   }
-  // Files of a kind whose contents are extracted.
-  int ContentRows(int kind) {
-    sqlite3* db = nullptr;
-    sqlite3_stmt* statement = nullptr;
-    sqlite3_open_v2((root_ + "/volume1/photo/@eaDir/TAVO@.fileindexdb/index.sqlite3").c_str(), &db,
-                    SQLITE_OPEN_READONLY, nullptr);
-    sqlite3_prepare_v2(db, "SELECT count(*) FROM contents WHERE kind = ? AND state = 1", -1, &statement,
-                       nullptr);
-    sqlite3_bind_int(statement, 1, kind);
-    int count = sqlite3_step(statement) == SQLITE_ROW ? sqlite3_column_int(statement, 0) : -1;
-    sqlite3_finalize(statement);
-    sqlite3_close(db);
-    return count;
-  }
-
   std::string top_;
 };
 
 TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
-  for (const char* dir : {"/photos", "/music", "/papers"}) fs::create_directories(top_ + dir);
-  ASSERT_TRUE(cs::WritePhoto(top_ + "/photos/harbour.jpg", cs::Exif()));
-  ASSERT_TRUE(cs::WritePhoto(top_ + "/photos/old.jpg", {"2009:01:02 08:00:00", "Osprey", "O2"}));
-  ASSERT_TRUE(cs::WriteAudio(top_ + "/music/song.mp3", cs::Tags()));
-  ASSERT_TRUE(cs::WriteAudio(top_ + "/music/reed.flac", {"Reedbed", "Marsh Wren", "Reeds"}, 2));
-  ASSERT_TRUE(
-      cs::WriteAudio(top_ + "/music/tide.opus", {"Slack Water", "Turnstone", "Ebb", "Ambient", 1999}, 7.5));
+  ASSERT_TRUE(cs::WritePhoto(top_ + "/harbour.jpg", cs::Exif()));
+  ASSERT_TRUE(cs::WriteAudio(top_ + "/song.mp3", cs::Tags()));
+  ASSERT_TRUE(cs::WriteAudio(top_ + "/reed.flac", {"Reedbed", "Marsh Wren", "Reeds"}, 2));
+  ASSERT_TRUE(cs::WriteAudio(top_ + "/tide.opus", {"Slack Water", "Turnstone", "Ebb"}, 7.5));
   ASSERT_TRUE(cs::WriteVideo(top_ + "/clip.mkv", "Lighthouse at dusk", 50));
-  cs::Write(top_ + "/papers/report.pdf",
-            cs::Pdf({"quarterly figures for the albatross project", "the second page mentions a cormorant"},
-                    "Seabird report"));
-  ASSERT_TRUE(cs::WriteDocx(top_ + "/papers/letter.docx", {"Dear committee,", "the puffin survey is done."}));
-  ASSERT_TRUE(cs::WriteOdt(top_ + "/papers/minutes.odt", {"Minutes of the guillemot meeting"}));
-  WriteFile(top_ + "/papers/notes.txt", "remember the kittiwake\n");
+  cs::Write(top_ + "/report.pdf",
+            cs::Pdf({"quarterly figures for the albatross project", "the second page mentions a cormorant"}));
+  ASSERT_TRUE(cs::WriteDocx(top_ + "/letter.docx", {"Dear committee,", "the puffin survey is done."}));
+  ASSERT_TRUE(cs::WriteOdt(top_ + "/minutes.odt", {"Minutes of the guillemot meeting"}));
+  WriteFile(top_ + "/notes.txt", "remember the kittiwake\n");
   // The content decides the kind; the name is a hint only.
-  const cs::Exif heron{"2012:03:04 05:06:07", "Heron", "H1"};
-  ASSERT_TRUE(cs::WritePhoto(top_ + "/photos/scan", heron));
-  ASSERT_TRUE(cs::WritePhoto(top_ + "/photos/scan2.dat", heron));
-  cs::Write(top_ + "/papers/invoice.jpg", cs::Pdf({"the invoice for the shearwater"}));
-  ASSERT_TRUE(cs::WriteAudio(top_ + "/music/take1.mp3", {"Harbour Lights", "Night Heron"}));
-  fs::rename(top_ + "/music/take1.mp3", top_ + "/music/take1");
+  ASSERT_TRUE(cs::WritePhoto(top_ + "/scan", {"2012:03:04 05:06:07", "Heron", "H1"}));
+  cs::Write(top_ + "/invoice.jpg", cs::Pdf({"the invoice for the shearwater"}));
+  ASSERT_TRUE(cs::WriteAudio(top_ + "/take1.mp3", {"Harbour Lights", "Night Heron"}));
+  fs::rename(top_ + "/take1.mp3", top_ + "/take1");
   cs::Write(top_ + "/empty", "");
   cs::Write(top_ + "/blob.bin", std::string(5000, '\x01') + "random");
-  const std::vector<std::string> all{
-      "photos/harbour.jpg", "photos/old.jpg",     "music/song.mp3",     "music/reed.flac",  "clip.mkv",
-      "papers/report.pdf",  "papers/letter.docx", "papers/minutes.odt", "papers/notes.txt", "music/tide.opus",
-      "photos/scan",        "photos/scan2.dat",   "papers/invoice.jpg", "music/take1"};
+  const std::vector<std::string> all{"harbour.jpg", "song.mp3",   "reed.flac",   "tide.opus",
+                                     "clip.mkv",    "report.pdf", "letter.docx", "minutes.odt",
+                                     "notes.txt",   "scan",       "invoice.jpg", "take1"};
   ASSERT_NO_FATAL_FAILURE(AddFolder());
   ASSERT_TRUE(WaitExtracted(all));
   ASSERT_TRUE(WaitExtracted({"blob.bin", "empty"}));
   for (const std::string& name : all) EXPECT_EQ(Why(name)["content"]["state"], "extracted") << name << Log();
-  for (const auto& decided : std::map<std::string, std::string>{{"photos/scan", "photo"},
-                                                                {"photos/scan2.dat", "photo"},
-                                                                {"papers/invoice.jpg", "document"},
-                                                                {"music/take1", "audio"},
-                                                                {"blob.bin", "other"}}) {
-    const std::string name = decided.first.substr(decided.first.rfind('/') + 1);
-    EXPECT_EQ(Kind(name.substr(0, name.find('.')), kAt + decided.first), decided.second) << decided.first;
-  }
+  for (const auto& [name, kind] : std::map<std::string, std::string>{
+           {"scan", "photo"}, {"invoice.jpg", "document"}, {"take1", "audio"}, {"blob.bin", "other"}})
+    EXPECT_EQ(Kind(name.substr(0, name.find('.')), kAt + name), kind) << name;
   EXPECT_EQ(Why("blob.bin")["state"], "indexed") << Why("blob.bin");
   EXPECT_EQ(Why("empty")["reason"], "indexed by its name (inode/x-empty)");
 
   // Why other files are not indexed.
   WriteFile(top_ + "/@eaDir/thumb.txt", "thumbnail\n");
-  Json::Value skipped = Why("@eaDir/thumb.txt");
-  EXPECT_EQ(skipped["state"], "skipped") << skipped;
-  EXPECT_EQ(skipped["indexed"], false);
+  EXPECT_EQ(Why("@eaDir/thumb.txt")["state"], "skipped");
   EXPECT_EQ(Run({"why", kAt + "@eaDir/thumb.txt"}).status, 3);
   EXPECT_EQ(Why("/photo/2019/beach.jpg")["state"], "outside");
   EXPECT_EQ(Why("nothing.txt")["state"], "missing");
 
   // A search -> the files it finds.
   const std::vector<std::pair<std::vector<std::string>, std::set<std::string>>> finds{
-      {{"--camera", "heron"}, {"photos/scan", "photos/scan2.dat"}},
-      {{"--kind", "document", "invoice"}, {"papers/invoice.jpg"}},
+      {{"--camera", "heron"}, {"scan"}},
+      {{"--kind", "document", "invoice"}, {"invoice.jpg"}},
       {{"--kind", "photo", "invoice"}, {}},
-      {{"--text", "shearwater"}, {"papers/invoice.jpg"}},
-      {{"--album", "REEDS"}, {"music/reed.flac"}},
-      {{"--year", "2011", "song"}, {"music/song.mp3"}},
-      {{"--taken-after", "2015-01-01"}, {"photos/harbour.jpg"}},
-      {{"--taken-before", "2009-01-02"}, {"photos/old.jpg"}},
-      {{"--text", "albatross"}, {"papers/report.pdf"}},
-      {{"--text", "CORMORANT"}, {"papers/report.pdf"}},
-      {{"--text", "puffin survey"}, {"papers/letter.docx"}},
-      {{"--text", "guillemot"}, {"papers/minutes.odt"}},
-      {{"--text", "kitti"}, {"papers/notes.txt"}},
+      {{"--album", "REEDS"}, {"reed.flac"}},
+      {{"--artist", "turnstone"}, {"tide.opus"}},
+      {{"--year", "2011", "song"}, {"song.mp3"}},
+      {{"--taken-after", "2015-01-01"}, {"harbour.jpg"}},
+      {{"--text", "CORMORANT"}, {"report.pdf"}},
+      {{"--text", "puffin survey"}, {"letter.docx"}},
+      {{"--text", "guillemot"}, {"minutes.odt"}},
+      {{"--text", "kitti"}, {"notes.txt"}},
       {{"--text", "puffin albatross"}, {}}};
   for (const auto& find : finds) {
     SCOPED_TRACE(::testing::PrintToString(find.first));
@@ -174,45 +137,31 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
     for (const std::string& name : find.second) expected.insert(kAt + name);
     EXPECT_EQ(Paths(find.first), expected);
   }
-  // A search -> its one hit's fields; durations within `slack` ms where the format rounds.
-  const struct {
-    std::vector<std::string> args;
-    const char *name, *fields;
-    double slack;
-  } hits[] = {
+  // A search -> the fields of its one hit, named by "name"; durations within 200 ms, as formats round.
+  const std::vector<std::pair<std::vector<std::string>, std::string>> hits{
       {{"--artist", "gulls"},
-       "music/song.mp3",
-       R"({"title": "Harbour Lights", "album": "Low Tide", "genre": "Folk", "year": 2011,
-           "duration_ms": 3000, "mime": "audio/mpeg"})",
-       200},
-      {{"--artist", "turnstone"},
-       "music/tide.opus",
-       R"({"title": "Slack Water", "album": "Ebb", "genre": "Ambient", "year": 1999, "duration_ms": 7500,
-           "mime": "audio/ogg"})",
-       0},
+       R"({"name": "song.mp3", "title": "Harbour Lights", "album": "Low Tide", "genre": "Folk",
+           "year": 2011, "duration_ms": 3000, "mime": "audio/mpeg"})"},
       {{"--camera", "kestrel k-100"},
-       "photos/harbour.jpg",
-       R"({"taken": "2019-07-14 10:11:12", "width": 32, "height": 24, "latitude": 48.8583,
-           "longitude": -2.2945})",
-       0},
+       R"({"name": "harbour.jpg", "taken": "2019-07-14 10:11:12", "width": 32, "height": 24,
+           "latitude": 48.8583, "longitude": -2.2945})"},
       {{"--title", "lighthouse"},
-       "clip.mkv",
-       R"({"width": 64, "codecs": "mjpeg", "duration_ms": 2000})",
-       100}};
-  for (const auto& hit : hits) {
-    SCOPED_TRACE(hit.name);
-    auto found = Search(hit.args);
+       R"({"name": "clip.mkv", "width": 64, "codecs": "mjpeg", "duration_ms": 2000})"}};
+  for (const auto& [args, fields] : hits) {
+    Json::Value expected = ParseJson(fields);
+    const std::string name = expected["name"].asString();
+    expected.removeMember("name");
+    SCOPED_TRACE(name);
+    auto found = Search(args);
     ASSERT_EQ(found.size(), 1u);
-    const Json::Value& content = found[kAt + hit.name];
-    const Json::Value expected = ParseJson(hit.fields);
-    ASSERT_TRUE(expected.isObject());
     for (const std::string& field : expected.getMemberNames()) {
-      if (field == "duration_ms" || expected[field].type() == Json::realValue)
-        EXPECT_NEAR(content[field].asDouble(), expected[field].asDouble(),
-                    field == "duration_ms" ? hit.slack : 0.001)
-            << field;
+      const Json::Value& value = found[kAt + name][field];
+      if (field == "duration_ms")
+        EXPECT_NEAR(value.asDouble(), expected[field].asDouble(), 200);
+      else if (expected[field].type() == Json::realValue)
+        EXPECT_NEAR(value.asDouble(), expected[field].asDouble(), 0.001) << field;
       else
-        EXPECT_EQ(content[field], expected[field]) << field;
+        EXPECT_EQ(value, expected[field]) << field;
     }
   }
   // Hits show the words around the match, marked.
@@ -220,42 +169,29 @@ TEST_F(ContentTest, FilesOfEachKindAreFoundByTheirFieldsAndText) {
   ASSERT_EQ(snippet["hits"].size(), 1u);
   EXPECT_EQ(snippet["hits"][0]["snippet"],
             "…for the albatross project the second page mentions a «cormorant»");
-  EXPECT_NE(Run({"search", "--text", "albatross"}).out.find("figures for the «albatross» project"),
-            std::string::npos);
-  EXPECT_GT(Search({"--title", "seabird"})[kAt + "papers/report.pdf"]["text_bytes"].asInt(), 40);
-  // The table shows the main fields.
-  Result table = Run({"search", "--artist", "gulls"});
-  EXPECT_NE(table.out.find("The Gulls, \"Harbour Lights\", Low Tide, 2011"), std::string::npos) << table.out;
 
-  // Audio switched off: its entries and contents go; on again, they come back.
-  ASSERT_GT(ContentRows(2), 0);
+  // Audio switched off: its files go, but a song whose name says nothing stays, by its name
+  // only; on again, they come back.
   ASSERT_EQ(Run({"folders", "set", "/photo/mixed", "--no-audio"}).status, 0);
-  ASSERT_TRUE(WaitUntil([&] { return ContentRows(2) == 0; }, kDeadline)) << Log();
-  EXPECT_TRUE(Search({"--artist", "gulls"}).empty());
-  EXPECT_EQ(Why("music/song.mp3")["state"], "kind-off");
-  EXPECT_EQ(Paths({"--text", "albatross"}).size(), 1u);  // the other kinds stay
-  // A song whose name says nothing stays, by its name only.
-  ASSERT_TRUE(WaitExtracted({"music/take1"}));
-  EXPECT_EQ(Kind("take1", kAt + "music/take1"), "other");
-  EXPECT_EQ(Why("music/take1")["content"]["state"], "skipped");
+  ASSERT_TRUE(WaitUntil([&] { return Why("song.mp3")["state"] == "kind-off"; }, kDeadline)) << Log();
+  ASSERT_TRUE(WaitExtracted({"take1"}));
+  EXPECT_EQ(Kind("take1", kAt + "take1"), "other");
+  EXPECT_EQ(Why("take1")["content"]["state"], "skipped");
   ASSERT_EQ(Run({"folders", "set", "/photo/mixed", "--audio"}).status, 0);
-  for (const char* artist : {"gulls", "night heron"})
-    EXPECT_TRUE(WaitUntil(
-        [&] {
-          return Search({"--artist", artist}).size() == 1;
-        },
-        kDeadline))
-        << artist << Log();
+  for (const char* artist : {"gulls", "night heron"}) {
+    auto back = [&] { return Search({"--artist", artist}).size() == 1; };
+    EXPECT_TRUE(WaitUntil(back, kDeadline)) << artist << Log();
+  }
 
   // A changed file is extracted again.
-  WriteFile(top_ + "/papers/notes.txt", "now the fulmar\n");
+  WriteFile(top_ + "/notes.txt", "now the fulmar\n");
   EXPECT_TRUE(WaitUntil([&] { return Paths({"--text", "fulmar"}).size() == 1; }, kDeadline)) << Log();
   EXPECT_TRUE(Paths({"--text", "kittiwake"}).empty());
 }
 
 // A PDF of one page whose packed content unpacks to 200 MB of text operators. Words kept
 // on the page pile up in the text extractor's memory; words moved off it cost time only.
-bool WritePdfBomb(const std::string& path, bool onPage) {
+void WritePdfBomb(const std::string& path, bool onPage) {
   std::string chunk, unpacked = "BT /F1 12 Tf 72 720 Td ";
   for (int i = 0; i < 1000; ++i) chunk += onPage ? "(bomb) Tj 0.0001 0 Td " : "(bomb) Tj 1 0 Td ";
   unpacked.reserve(200u << 20);
@@ -270,32 +206,27 @@ bool WritePdfBomb(const std::string& path, bool onPage) {
   const std::string shown = "BT /F1 12 Tf 72 720 Td (placeholder) Tj ET";
   const std::string plain =
       "<< /Length " + std::to_string(shown.size()) + " >>\nstream\n" + shown + "\nendstream";
-  if (pdf.find(plain) == std::string::npos) return false;
   pdf.replace(pdf.find(plain), plain.size(),
               "<< /Length " + std::to_string(packed.size()) + " /Filter /FlateDecode >>\nstream\n" + packed +
                   "\nendstream");
   cs::Write(path, pdf);  // (the offsets are off now: poppler reconstructs them)
-  return true;
 }
 
 TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
   // truncated.jpg: cut inside its EXIF block.
-  ASSERT_TRUE(cs::WritePhoto(top_ + "/whole.jpg", cs::Exif()));
-  std::string jpeg = ReadFile(top_ + "/whole.jpg");
-  fs::remove(top_ + "/whole.jpg");
-  std::size_t exif = jpeg.find(std::string("Exif\0\0", 6));
-  ASSERT_NE(exif, std::string::npos);
-  cs::Write(top_ + "/truncated.jpg", jpeg.substr(0, exif + 60));
-  ASSERT_TRUE(WritePdfBomb(top_ + "/bomb.pdf", true));
-  ASSERT_TRUE(WritePdfBomb(top_ + "/slow.pdf", false));
-  // huge-tag.mp3: a 32 MiB ID3v2 tag (its size in 7-bit bytes) of one TXXX frame, before the audio.
-  const std::uint32_t tagSize = 32u << 20, frameSize = tagSize - 10;
-  std::string tag = std::string("ID3\x03\x00\x00", 6);
-  for (int shift = 21; shift >= 0; shift -= 7) tag += static_cast<char>((tagSize >> shift) & 0x7F);
-  tag += "TXXX";
-  for (int shift = 24; shift >= 0; shift -= 8) tag += static_cast<char>((frameSize >> shift) & 0xFF);
-  cs::Write(top_ + "/huge-tag.mp3",
-            tag + std::string(3, '\0') + std::string(frameSize - 1, 'x') + cs::Mp3Frames(1));
+  ASSERT_TRUE(cs::WritePhoto(top_ + "/truncated.jpg", cs::Exif()));
+  const std::string jpeg = ReadFile(top_ + "/truncated.jpg");
+  cs::Write(top_ + "/truncated.jpg", jpeg.substr(0, jpeg.find(std::string("Exif\0\0", 6)) + 60));
+  WritePdfBomb(top_ + "/bomb.pdf", true);
+  WritePdfBomb(top_ + "/slow.pdf", false);
+  // huge-tag.mp3: a 32 MiB ID3v2.3 tag (its size in 7-bit bytes: 10 00 00 00) of one TXXX frame
+  // (32 MiB - 10: 01 FF FF F6), before the audio.
+  const std::string tag(
+      "ID3\x03\x00\x00\x10\x00\x00\x00"
+      "TXXX\x01\xFF\xFF\xF6"
+      "\x00\x00\x00",
+      21);
+  cs::Write(top_ + "/huge-tag.mp3", tag + std::string((32u << 20) - 11, 'x') + cs::Mp3Frames(1));
   // bomb.docx: a zip whose document unpacks to 256 MiB of spaces.
   ASSERT_TRUE(cs::WriteZip(
       top_ + "/bomb.docx",
@@ -304,52 +235,41 @@ TEST_F(ContentTest, HostileFilesAreRecordedAsFailedAndTheServiceGoesOn) {
       9));
   WriteFile(top_ + "/after.txt", "the sandpiper comes last\n");
 
-  const std::vector<std::string> hostile{"truncated.jpg", "bomb.pdf", "slow.pdf", "huge-tag.mp3",
-                                         "bomb.docx"};
+  // Each failed, and why.
+  const std::map<std::string, std::string> reasons{{"truncated.jpg", "Exiv2"},
+                                                   {"slow.pdf", "longer than the limit of 3000 ms"},
+                                                   {"huge-tag.mp3", "ID3v2 tag of 32 MiB"},
+                                                   {"bomb.docx", "word/document.xml"}};
   auto started = std::chrono::steady_clock::now();
   ASSERT_NO_FATAL_FAILURE(AddFolder("FILEINDEXD_EXTRACT_TIME_LIMIT=3 FILEINDEXD_EXTRACT_MEMORY_LIMIT=256 "));
-  std::vector<std::string> names = hostile;
-  names.push_back("after.txt");
-  ASSERT_TRUE(WaitExtracted(names));
+  ASSERT_TRUE(
+      WaitExtracted({"truncated.jpg", "bomb.pdf", "slow.pdf", "huge-tag.mp3", "bomb.docx", "after.txt"}))
+      << Log();
   // One file at a time, each within its limit of 3 s: none took much longer.
   EXPECT_LT(std::chrono::steady_clock::now() - started, 30s);
-
-  std::map<std::string, std::string> reasons;
-  for (const std::string& name : hostile) {
-    Json::Value why = Why(name);
-    EXPECT_EQ(why["state"], "failed") << name << ": " << why.toStyledString();
-    reasons[name] = why["content"]["reason"].asString();
+  for (const auto& [name, reason] : reasons) {
+    const Json::Value why = Why(name);
+    EXPECT_EQ(why["state"], "failed") << name;
+    EXPECT_NE(why["content"]["reason"].asString().find(reason), std::string::npos) << name << ": " << why;
   }
-  for (const auto& reason :
-       std::map<std::string, std::string>{{"truncated.jpg", "Exiv2"},
-                                          {"huge-tag.mp3", "ID3v2 tag of 32 MiB"},
-                                          {"bomb.docx", "word/document.xml"},
-                                          {"slow.pdf", "longer than the limit of 3000 ms"}})
-    EXPECT_NE(reasons[reason.first].find(reason.second), std::string::npos)
-        << reason.first << ": " << reasons[reason.first];
-  // The bombs take the worker down: one by its memory limit (poppler aborts when an
-  // allocation fails; the sanitizer build's limit is slower and may lose to the time
-  // limit), the other (above) by its time limit.
-  const std::string& bomb = reasons["bomb.pdf"];
-  EXPECT_TRUE(bomb.find("killed by signal 6") != std::string::npos ||
-              bomb.find("out of memory") != std::string::npos ||
-              bomb.find("longer than the limit of 3000 ms") != std::string::npos)
-      << bomb;
-  // ... and another worker took over: the file after it was extracted.
+  // The bomb takes the worker down by its memory limit (poppler aborts when an allocation
+  // fails; the sanitizer build's limit is slower and may lose to the time limit) ...
+  const Json::Value bomb = Why("bomb.pdf");
+  const std::string why = bomb["content"]["reason"].asString();
+  EXPECT_EQ(bomb["state"], "failed");
+  EXPECT_TRUE(why.find("killed by signal 6") != std::string::npos ||
+              why.find("out of memory") != std::string::npos ||
+              why.find("longer than the limit of 3000 ms") != std::string::npos)
+      << why;
+  // ... and another worker takes over: the file after it is extracted.
   EXPECT_EQ(Paths({"--text", "sandpiper"}), std::set<std::string>{kAt + "after.txt"});
-  const std::string log = Log();
-  std::size_t workers = 0;
-  for (std::size_t at = log.find("extraction worker "); at != std::string::npos;
-       at = log.find("extraction worker ", at + 1))
-    workers += log.compare(log.find(' ', at + 18), 8, " started") == 0;
-  EXPECT_GE(workers, 2u) << log;
   EXPECT_EQ(RunJson({"status"})["status"], "finished");  // the daemon itself never stopped
 }
 
 // A worker that dies on a file (here by SIGABRT, as a library that aborts would) takes only
 // that file down: it is recorded as failed with the signal, and the next worker goes on.
 TEST_F(ContentTest, AWorkerThatCrashesFailsOnlyItsFile) {
-  ASSERT_TRUE(WritePdfBomb(top_ + "/bomb.pdf", false));
+  WritePdfBomb(top_ + "/bomb.pdf", false);
   ASSERT_NO_FATAL_FAILURE(AddFolder("FILEINDEXD_EXTRACT_TIME_LIMIT=60 "));
   // The worker: the daemon's child, busy once it has used some CPU time (user + system) on the bomb.
   pid_t worker = 0;
@@ -371,12 +291,8 @@ TEST_F(ContentTest, AWorkerThatCrashesFailsOnlyItsFile) {
   EXPECT_EQ(why["state"], "failed");
   EXPECT_NE(why["content"]["reason"].asString().find("killed by signal 6"), std::string::npos) << why;
   WriteFile(top_ + "/after.txt", "the turnstone\n");
-  EXPECT_TRUE(WaitUntil(
-      [&] {
-        return Paths({"--text", "turnstone"}).size() == 1;
-      },
-      kDeadline))
-      << Why("after.txt") << Log();
+  auto found = [&] { return Paths({"--text", "turnstone"}).size() == 1; };
+  EXPECT_TRUE(WaitUntil(found, kDeadline)) << Why("after.txt") << Log();
 }
 
 }  // namespace
