@@ -37,18 +37,14 @@ TEST_F(StatusTest, PauseStoresResumeTimeAndTellsDaemon) {
 TEST_F(StatusTest, NoSpaceNotifiesOnceAndOnlyTwoQuotaErrorsMeanShort) {
   ASSERT_TRUE(StatusMgr::ShareSetNoSpace("photo", true));
   ASSERT_TRUE(StatusMgr::ShareSetNoSpace("photo", true));
-  const Strings notify{"/usr/tavo/bin/tavovemnotify",
-                       "-e",
-                       "false",
-                       "-c",
-                       "TAVO.KOR.AdminCenter.Application",
-                       "@administrators",
-                       "fileindex:fileindex_title",
-                       "fileindex:notify_no_space",
-                       "<a data-tavo-app=\"TAVO.KOR.AdminCenter.Application\" "
-                       "data-tavo-fn=\"TAVO.KOR.AdminCenter.MediaIndex.Main\" data-tavo-tab=\"fileIndex\">",
-                       "</a>"};
-  EXPECT_EQ(fake::Get().execs, std::vector<Strings>{notify});
+  ASSERT_EQ(fake::Get().execs.size(), 1u);
+  std::string command;  // the arguments, each followed by "|"
+  for (const std::string& argument : fake::Get().execs[0]) command += argument + "|";
+  EXPECT_EQ(command,
+            "/usr/tavo/bin/tavovemnotify|-e|false|-c|TAVO.KOR.AdminCenter.Application|@administrators|"
+            "fileindex:fileindex_title|fileindex:notify_no_space|<a data-tavo-app=\"TAVO.KOR.AdminCenter."
+            "Application\" data-tavo-fn=\"TAVO.KOR.AdminCenter.MediaIndex.Main\" "
+            "data-tavo-tab=\"fileIndex\">|</a>|");
   fake::Get().execvResult = 1;
   ASSERT_TRUE(StatusMgr::ShareSetNoSpace("video", true));
   EXPECT_EQ(logcap::Count("NotifyNoSpace failed"), 1);
