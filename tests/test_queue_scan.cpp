@@ -103,13 +103,17 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
         R"({"event":2,"path":"\/v\/\"q\"/\\/\b\f\n\r\t\u00e9\ud83d\ude00\udc00"})",
         R"({"data":{"inode":12,"size":0,"mtime":-1700000000},"event":2,"path":"/v/p/a"})",
         R"({"event":8,"path":"/a","data":{"a":"s","b":true,"c":null,"d":false}})",
+        R"({"event":8,"path":"/a","data":{"a}":1,"b,:{":-0,"":123456789012345,"z":70}})",
+        R"({"data":{"n":1234567890123456,"size":0},"event":2,"path":"/a"})",
+        R"({"event":8,"path":"/a","data":{"inode":123456789,"size":123456789,"mtime":1700000000,"c":1}})",
         "{\"event\":2,\"path\":\"" + std::string(70000, 'l') + "\"}"}},
       {QueueLineKind::kNotEvent,
        {"", R"({"event":2,"path":"/v/p\u00)", R"({"event":2,"path":"/a"} x)", R"({"event":"8","path":"/a"})",
         R"({"event":4294967296,"path":"/a"})", R"({"path":"/a"})"}},
       {QueueLineKind::kUndecided,
-       {R"({"event":1.5,"path":"/a"})", R"({"event":-0,"path":"/a"})", R"({"\u0065vent":2,"path":"/a"})",
-        R"({"event":2,"path":"/a\ud800"})", "{\"event\":2,\"path\":\"/a\"}\0/x"s,
+       {R"({"event":1.5,"path":"/a"})", R"({"event":8,"path":"/a","data":{7,"a":2}})",
+        R"({"event":-0,"path":"/a"})", R"({"\u0065vent":2,"path":"/a"})", R"({"event":2,"path":"/a\ud800"})",
+        "{\"event\":2,\"path\":\"/a\"}\0/x"s,
         "{\"event\":2,\"path\":\"/a\",\"d\":" + std::string(5000, '[') + std::string(5000, ']') + "}"}}};
   std::string edited;
   for (const auto& [kind, lines] : table)
@@ -117,7 +121,8 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
       EXPECT_EQ(ExpectAlike(line), kind) << ::testing::PrintToString(line);
       for (size_t i = 0; line.size() < 200 && i < line.size(); ++i) {
         edited += line.substr(0, i) + line.substr(i + 1) + "\n";
-        for (char c : std::string("\"{}[],:\\ 0-e")) edited += line.substr(0, i) + c + line.substr(i) + "\n";
+        for (char c : std::string("\"{}[],:\\ 0-e\n"))
+          edited += line.substr(0, i) + c + line.substr(i) + "\n";
       }
     }
   Rng rng(1);
