@@ -14,6 +14,8 @@ namespace {
 struct Figure {
   double seconds = 0;      // real time per iteration
   double bytesPerSec = 0;  // 0 when the benchmark reads no file
+  double share = 0;        // a paired benchmark's median share of its reference's speed
+  double pairs = 0;
   bool failed = false;
 };
 
@@ -32,6 +34,10 @@ class SummaryReporter : public benchmark::ConsoleReporter {
         figure.seconds = run.real_accumulated_time / static_cast<double>(run.iterations);
       auto bytes = run.counters.find("bytes_per_second");
       if (bytes != run.counters.end()) figure.bytesPerSec = bytes->second.value;
+      auto share = run.counters.find("share");
+      if (share != run.counters.end()) figure.share = share->second.value;
+      auto pairs = run.counters.find("pairs");
+      if (pairs != run.counters.end()) figure.pairs = pairs->second.value;
       // "<scenario>/<variant>", followed by what the library appends ("/real_time").
       const std::string name = run.benchmark_name();
       const std::string::size_type slash = name.find('/');
@@ -56,6 +62,9 @@ class SummaryReporter : public benchmark::ConsoleReporter {
           const double speedup = baseline->seconds / figure.seconds;
           ratio = speedup >= 1 ? Printf("%.1fx faster", speedup) : Printf("%.2fx slower", 1 / speedup);
         }
+        if (figure.share > 0)
+          ratio = Printf("%.2f of read_count_lines's speed", figure.share) +
+                  Printf(" (median of %.0f pairs)", figure.pairs);
         std::printf("%-28s %-15s %12s %12s  %s\n", scenario.c_str(), entry.first.c_str(),
                     figure.failed ? "FAILED" : Rate(figure).c_str(), Time(figure.seconds).c_str(),
                     ratio.c_str());

@@ -6,9 +6,12 @@
 #include <fileindex/utils.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <chrono>
 #include <cstring>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "bench_env.h"
 #include "bench_registry.h"
@@ -154,6 +157,24 @@ void ReadFileOnly(benchmark::State& state) {
   Finish(state, env);
 }
 
+// Reads the file and counts its lines; false when it cannot be opened.
+bool CountLines(const std::string& path, char* buffer, size_t& lines) {
+  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return false;
+  lines = 0;
+  ssize_t n;
+  while ((n = ::read(fd, buffer, 1 << 20)) > 0) {
+    const char* p = buffer;
+    const char* const end = p + n;
+    while ((p = static_cast<const char*>(std::memchr(p, '\n', static_cast<size_t>(end - p)))) != nullptr) {
+      ++lines;
+      ++p;
+    }
+  }
+  ::close(fd);
+  return true;
+}
+
 // Reading the file and counting its lines: what a scan that looks at every byte once
 // could at best reach.
 void ReadCountLines(benchmark::State& state, QueueEnv& (*envOf)()) {
@@ -161,28 +182,39 @@ void ReadCountLines(benchmark::State& state, QueueEnv& (*envOf)()) {
   Prepare(state, env);
   std::unique_ptr<char[]> buffer(new char[1 << 20]);
   for (auto _ : state) {
-    int fd = ::open(env.queue.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) {
-      state.SkipWithError("cannot open the queue");
-      break;
-    }
     size_t lines = 0;
-    ssize_t n;
-    while ((n = ::read(fd, buffer.get(), 1 << 20)) > 0) {
-      const char* p = buffer.get();
-      const char* const end = p + n;
-      while ((p = static_cast<const char*>(std::memchr(p, '\n', static_cast<size_t>(end - p)))) != nullptr) {
-        ++lines;
-        ++p;
-      }
-    }
-    ::close(fd);
-    if (lines != env.stats.lines + 1) {
+    if (!CountLines(env.queue, buffer.get(), lines) || lines != env.stats.lines + 1) {
       state.SkipWithError("wrong line count");
       break;
     }
   }
   Finish(state, env);
+}
+
+// The folder status against reading the file and counting its lines, timed in turn, so
+// that a change in the machine's load falls on both alike: the median over the pairs of
+// the status's speed as a share of the line count's.
+void StatusShareOfLineCount(benchmark::State& state, QueueEnv& (*envOf)()) {
+  using Clock = std::chrono::steady_clock;
+  QueueEnv& env = envOf();
+  Prepare(state, env);
+  std::unique_ptr<char[]> buffer(new char[1 << 20]);
+  std::vector<double> shares;
+  for (auto _ : state) {
+    const Clock::time_point start = Clock::now();
+    benchmark::DoNotOptimize(TAVO::FILEINDEX::StatusMgr::GetFolderStatus("/photo/2019"));
+    const Clock::time_point scanned = Clock::now();
+    size_t lines = 0;
+    if (!CountLines(env.queue, buffer.get(), lines) || lines != env.stats.lines + 1) {
+      state.SkipWithError("wrong line count");
+      return;
+    }
+    shares.push_back(std::chrono::duration<double>(Clock::now() - scanned).count() /
+                     std::chrono::duration<double>(scanned - start).count());
+  }
+  std::sort(shares.begin(), shares.end());
+  state.counters["share"] = shares.empty() ? 0 : shares[shares.size() / 2];
+  state.counters["pairs"] = static_cast<double>(shares.size());
 }
 
 // The library's line splitting alone.
@@ -220,6 +252,12 @@ void RegisterQueueBenchmarks() {
   realTime(
       benchmark::RegisterBenchmark("read_count_lines_as_written/reference", ReadCountLines, &WrittenQueue));
   realTime(benchmark::RegisterBenchmark("line_reader_only/reference", LineReaderOnly));
+  // Enough pairs for a steady median.
+  for (auto* pairs :
+       {benchmark::RegisterBenchmark("queue_scan_share/paired", StatusShareOfLineCount, &CleanQueue),
+        benchmark::RegisterBenchmark("queue_scan_as_written_share/paired", StatusShareOfLineCount,
+                                     &WrittenQueue)})
+    realTime(pairs->MinTime(3));
 }
 
 }  // namespace bench
