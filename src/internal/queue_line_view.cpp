@@ -736,12 +736,11 @@ inline __attribute__((always_inline)) const char* FlatNumbersEnd(const char* obj
 
 #if defined(__x86_64__) && defined(__GNUC__)
 #define FIDX_HAVE_FLAT_NUMBERS 1
-// FlatNumbersEnd with the masks of the 64 bytes taken at once, on processors that have
-// AVX-512BW.
-__attribute__((target("avx512bw"))) const char* FlatNumbersAvx512(const char* object) {
+// The masks of the 64 bytes at once, on processors that have AVX-512BW.
+__attribute__((target("avx512bw"), always_inline)) inline ObjectBytes ObjectBytesAvx512(const char* object) {
   const __m512i bytes = _mm512_loadu_si512(object);
 #define FIDX_BYTES_EQUAL(c) _mm512_cmpeq_epi8_mask(bytes, _mm512_set1_epi8(c))
-  const ObjectBytes b = {
+  return {
       FIDX_BYTES_EQUAL('"'),
       FIDX_BYTES_EQUAL('\\'),
       FIDX_BYTES_EQUAL('\n'),
@@ -753,7 +752,21 @@ __attribute__((target("avx512bw"))) const char* FlatNumbersAvx512(const char* ob
       FIDX_BYTES_EQUAL('}'),
   };
 #undef FIDX_BYTES_EQUAL
-  return FlatNumbersEnd(object, b);
+}
+
+__attribute__((target("avx512bw"))) const char* FlatNumbersAvx512(const char* object) {
+  return FlatNumbersEnd(object, ObjectBytesAvx512(object));
+}
+
+// For an object that must end its line ("}" and the newline right after it): where the
+// newline is, taken from its mask alone, so that reading the next line need not wait
+// for the object's check; ok tells whether the object and the line's end are as said.
+__attribute__((target("avx512bw"))) const char* FlatNumbersLineEndAvx512(const char* object, bool& ok) {
+  const ObjectBytes b = ObjectBytesAvx512(object);
+  const char* newline = object + __builtin_ctzll(b.newline | (uint64_t(1) << 63));
+  const char* end = FlatNumbersEnd(object, b);
+  ok = b.newline != 0 && end != nullptr && *end == '}' && end + 1 == newline;
+  return newline;
 }
 
 // Elsewhere objects are read member by member: with narrower vectors, building the masks
@@ -915,7 +928,20 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
     if (Equals(p, kPathOld)) {
       p = member(p + sizeof(kPathOld) - 1, out.pathOld, out.pathOldSize, out.pathOldStorage);
     } else if (!dataFirst && Equals(p, kData)) {
-      p = data(p + sizeof(kData) - 1);
+      p += sizeof(kData) - 1;
+#ifdef FIDX_HAVE_FLAT_NUMBERS
+      // Last in the line, a flat object of numbers need not hold up the next line.
+      if (kHaveFlatNumbers && *p == '{' && p + 64 <= line + kSpan && p[1] != '}') {
+        bool ok;
+        const char* newline = FlatNumbersLineEndAvx512(p, ok);
+        if (ok && newline < limit) {
+          out.event = static_cast<unsigned>(event);
+          lineEnd = newline;
+          return true;
+        }
+      }
+#endif
+      p = data(p);
     } else {
       return false;
     }
