@@ -127,6 +127,9 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
           edited += line.substr(0, i) + c + line.substr(i) + "\n";
       }
     }
+  // Paths of every length up to three mask words, so that a path's closing quote falls in each
+  // word the run reader's stop search looks at, whatever the line's offset.
+  for (size_t n = 0; n < 200; ++n) edited += "{\"event\":2,\"path\":\"" + std::string(n, 'p') + "\"}\n";
   Rng rng(1);
   size_t lines = 0, valid = 0, events = 0, refused = 0;
   for (int round = 0; round <= 100 && !::testing::Test::HasFailure(); ++round) {

@@ -790,6 +790,7 @@ void QueueRunClassifier::Fill(const char* at) {
   size_t words = static_cast<size_t>(end_ - at) / 64;
   if (words > kWords) words = kWords;
   ComputeStopMasks(at, words, masks_);
+  masks_[words] = 0;  // read with the word before it, never a stop
   window_ = at;
   windowEnd_ = at + words * 64;
 }
@@ -811,16 +812,27 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
   const char* const limit = line + kSpan - kReach;
   // The first quote, backslash or newline in [p, limit); stringEnd takes only a quote,
   // the end of a string without escapes.
+  // Two words are looked at before any branch: whether a path ends in the word where it
+  // starts or in the next one is as good as random.
   auto firstStop = [&](const char* p) -> const char* {
     const size_t at = static_cast<size_t>(p - window_);
     size_t word = at / 64;
-    uint64_t mask = masks_[word] & (~uint64_t(0) << (at % 64));
-    const size_t lastWord = static_cast<size_t>(limit - window_ - 1) / 64;
-    while (mask == 0) {
-      if (++word > lastWord) return nullptr;
-      mask = masks_[word];
+    const uint64_t mask = masks_[word] & (~uint64_t(0) << (at % 64));
+    const uint64_t next = masks_[word + 1];
+    const char* stop;
+    if ((mask | next) != 0) {
+      stop = window_ + word * 64 + (mask != 0 ? __builtin_ctzll(mask) : 64 + __builtin_ctzll(next));
+    } else {
+      // A longer path: the words after those two.
+      const size_t lastWord = static_cast<size_t>(limit - window_ - 1) / 64;
+      uint64_t later;
+      ++word;
+      do {
+        if (++word > lastWord) return nullptr;
+        later = masks_[word];
+      } while (later == 0);
+      stop = window_ + word * 64 + __builtin_ctzll(later);
     }
-    const char* stop = window_ + word * 64 + __builtin_ctzll(mask);
     return stop < limit ? stop : nullptr;
   };
   auto stringEnd = [&](const char* p) -> const char* {
@@ -899,7 +911,9 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
     p += sizeof(kEvent) - 1;
   }
   const size_t digits = Digits16(p);
-  if (digits == 0 || digits > 10 || (digits > 1 && *p == '0')) return false;
+  // One branch for all three conditions: the count of digits differs from line to line,
+  // and a branch on it would be mispredicted as often.
+  if ((digits - 1 > 9) | ((digits > 1) & (*p == '0'))) return false;
   uint64_t event = digits <= 8 ? EightDigits(p, digits)
                                : EightDigits(p, digits - 8) * 100000000u + EightDigits(p + digits - 8, 8);
   if (event > UINT_MAX) return false;

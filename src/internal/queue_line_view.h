@@ -81,7 +81,7 @@ class QueueRunClassifier {
   const char* const end_;
   const char* window_;
   const char* windowEnd_;
-  uint64_t masks_[kWords];
+  uint64_t masks_[kWords + 1];
 };
 
 }  // namespace internal
