@@ -277,15 +277,20 @@ inline std::string CheckQueueRun(const uint8_t* data, size_t size) {
   // The fuzzer's own buffer, of exactly its size: a read past the run is seen.
   const char* const begin = reinterpret_cast<const char*>(data);
   const char* const end = begin + size;
-  fi::internal::QueueRunClassifier run(begin, end);
+  fi::internal::QueueRunClassifier run(begin, end), unread(begin, end);
   for (const char* line = begin; line < end;) {
-    fi::internal::QueueEventView byRun, alone;
+    fi::internal::QueueEventView byRun, alone, kindOnly;
     const char* runEnd = nullptr;
     const char* aloneEnd = nullptr;
+    const char* kindOnlyEnd = nullptr;
     const fi::internal::QueueLineKind kind = run.Classify(line, byRun, runEnd);
     const char* next = std::find(line, end, '\n');
     if (kind != fi::internal::ClassifyQueueLine(line, end, alone, aloneEnd))
       return "QueueRunClassifier decides otherwise than ClassifyQueueLine: " + Show(std::string(line, next));
+    if (unread.Classify(line, kindOnly, kindOnlyEnd, fi::internal::QueuePaths::kUnread) != kind ||
+        (kind == fi::internal::QueueLineKind::kEvent && kindOnlyEnd != runEnd))
+      return "QueueRunClassifier decides otherwise when the paths are unread: " +
+             Show(std::string(line, next));
     if (kind == fi::internal::QueueLineKind::kEvent &&
         (runEnd != aloneEnd || byRun.event != alone.event ||
          std::string(byRun.path, byRun.pathSize) != std::string(alone.path, alone.pathSize) ||

@@ -185,7 +185,10 @@ void ScanQueue(internal::QueueLineReader& reader, const std::vector<std::string>
     internal::QueueRunClassifier run(data, end);
     for (const char* line = data; line < end;) {
       const char* lineEnd = nullptr;
-      const internal::QueueLineKind kind = run.Classify(line, view, lineEnd);
+      // Once every folder is found, the paths are no longer read: only whether each line
+      // is an event.
+      const internal::QueueLineKind kind = run.Classify(
+          line, view, lineEnd, unfound != 0 ? internal::QueuePaths::kRead : internal::QueuePaths::kUnread);
       if (kind == internal::QueueLineKind::kEvent) {
         mark(view.path, view.pathSize, view.event, view.pathOld, view.pathOldSize);
       } else {

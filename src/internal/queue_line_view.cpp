@@ -246,9 +246,22 @@ class Reader {
   Reader(const char* begin, const char* limit) : begin_(begin), end_(limit) {}
 
   // At the opening quote of a string member that is read: the position after its closing
-  // quote, or null; value and size as Member gives them.
-  const char* ReadMember(const char* p, const char*& value, size_t& size, std::string& storage) const {
-    return Member(p, value, size, storage);
+  // quote, or null; value and size as Member gives them, or null and 0 when the member has
+  // escapes and is not to be decoded.
+  const char* ReadMember(const char* p, const char*& value, size_t& size, std::string& storage,
+                         QueuePaths paths) const {
+    if (paths == QueuePaths::kRead) return Member(p, value, size, storage);
+    const char* begin;
+    const char* end;
+    bool escaped;
+    p = String(p, begin, end, escaped, true);
+    value = nullptr;
+    size = 0;
+    if (p != nullptr && !escaped) {
+      value = begin;
+      size = static_cast<size_t>(end - begin);
+    }
+    return p;
   }
 
   QueueLineKind Line(QueueEventView& out, const char*& lineEnd) const {
@@ -795,7 +808,8 @@ void QueueRunClassifier::Fill(const char* at) {
   windowEnd_ = at + words * 64;
 }
 
-bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const char*& lineEnd) {
+bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const char*& lineEnd,
+                                QueuePaths paths) {
   static const char kEvent[] = "{\"event\":";
   static const char kPath[] = ",\"path\":\"";
   static const char kPathOld[] = ",\"path_old\":\"";
@@ -931,7 +945,7 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
       size = static_cast<size_t>(stop - p);
       return stop + 1;
     }
-    stop = Reader(line, end_).ReadMember(p - 1, value, size, storage);
+    stop = Reader(line, end_).ReadMember(p - 1, value, size, storage, paths);
     return stop != nullptr && stop < limit ? stop : nullptr;
   };
   out.pathOld = nullptr;

@@ -51,6 +51,10 @@ enum class QueueLineKind {
 QueueLineKind ClassifyQueueLine(const char* data, const char* limit, QueueEventView& out,
                                 const char*& lineEnd);
 
+// Whether the caller reads an event's paths, or only needs to know that the line is one:
+// decoding a path with escapes is then left out.
+enum class QueuePaths { kRead, kUnread };
+
 // ClassifyQueueLine for each line of a run of whole lines, as QueueLineReader::NextLines
 // hands them out, asked front to back. The line as the daemon writes it is read from bit
 // masks of the run's quotes, backslashes and newlines, computed a few kilobytes at a time
@@ -61,9 +65,11 @@ class QueueRunClassifier {
   QueueRunClassifier(const char* data, const char* end) : end_(end), window_(data), windowEnd_(data) {}
 
   // What ClassifyQueueLine(line, end, out, lineEnd) answers, for line at the start of a
-  // line of the run; asked front to back, the masks are computed once.
-  QueueLineKind Classify(const char* line, QueueEventView& out, const char*& lineEnd) {
-    if (Common(line, out, lineEnd)) return QueueLineKind::kEvent;
+  // line of the run; asked front to back, the masks are computed once. With kUnread, out's
+  // paths may be left null.
+  QueueLineKind Classify(const char* line, QueueEventView& out, const char*& lineEnd,
+                         QueuePaths paths = QueuePaths::kRead) {
+    if (Common(line, out, lineEnd, paths)) return QueueLineKind::kEvent;
     return ClassifyQueueLine(line, end_, out, lineEnd);
   }
 
@@ -74,7 +80,7 @@ class QueueRunClassifier {
   // True when the line is compact, with "event" first or with its members in the order
   // of their names (as the JSON library writes them), and escapes only in its paths; out
   // is then read. False leaves the line to ClassifyQueueLine.
-  bool Common(const char* line, QueueEventView& out, const char*& lineEnd);
+  bool Common(const char* line, QueueEventView& out, const char*& lineEnd, QueuePaths paths);
   // Masks for the bytes from at on, as many words as the run has left.
   void Fill(const char* at);
 
