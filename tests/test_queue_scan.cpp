@@ -113,8 +113,8 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
         R"({"event":8,"path":"/a","data":{"inode":123456789,"size":123456789,"mtime":1700000000,"c":12}} x)"}},
       {QueueLineKind::kUndecided,
        {R"({"event":1.5,"path":"/a"})", R"({"event":8,"path":"/a","data":{7,"a":2}})",
-        R"({"event":8,"path":"/a","data":{"a":1}])", R"({"event":-0,"path":"/a"})",
-        R"({"\u0065vent":2,"path":"/a"})", R"({"event":2,"path":"/a\ud800"})",
+        R"({"event":8,"path":"/a","data":{"a":1}])", R"({"event":8,"path":"/a","data":{"a":1]})",
+        R"({"event":-0,"path":"/a"})", R"({"\u0065vent":2,"path":"/a"})", R"({"event":2,"path":"/a\ud800"})",
         "{\"event\":2,\"path\":\"/a\"}\0/x"s,
         "{\"event\":2,\"path\":\"/a\",\"d\":" + std::string(5000, '[') + std::string(5000, ']') + "}"}}};
   std::string edited;

@@ -710,22 +710,14 @@ struct ObjectBytes {
   uint64_t quote, backslash, newline, colon, comma, minus, digit, zero, close;
 };
 
-// The end of the object whose "{" is the first of the 64 bytes, when it lies within them
-// and holds only members with plain names and numbers as the general reading takes them
-// (no leading zero, at most 15 digits, no fraction or exponent); null otherwise. All its
-// tokens are checked at once from the byte masks, with no step waiting for the one before,
-// which is where reading member by member spends its time.
-inline __attribute__((always_inline)) const char* FlatNumbersEnd(const char* object, const ObjectBytes& b) {
-  // Without a backslash before the object's end, quotes pair up: a byte is inside a
-  // string when an odd number of quotes precede it or sit on it (an opening quote is
-  // inside, a closing quote outside).
-  uint64_t inString = b.quote;
-  for (int shift = 1; shift < 64; shift *= 2) inString ^= inString << shift;
-  const uint64_t closes = b.close & ~inString;
-  if (closes == 0) return nullptr;
-  const uint64_t last = closes & (~closes + 1);
+// Whether the object whose "{" is the first of the 64 bytes, and whose "}" is at the bit
+// last, holds only members with plain names and numbers as the general reading takes them
+// (no leading zero, at most 15 digits, no fraction or exponent). inString marks the bytes
+// inside its strings. All its tokens are checked at once from the byte masks, with no step
+// waiting for the one before, which is where reading member by member spends its time.
+inline __attribute__((always_inline)) bool FlatNumbers(const ObjectBytes& b, uint64_t inString,
+                                                       uint64_t last) {
   const uint64_t within = last | (last - 1);
-  if (((b.backslash | b.newline) & within) != 0) return nullptr;
   const uint64_t outside = ~inString & within;
   const uint64_t opening = b.quote & inString & within;
   const uint64_t closing = b.quote & outside;
@@ -735,16 +727,32 @@ inline __attribute__((always_inline)) const char* FlatNumbersEnd(const char* obj
   const uint64_t firstDigits = (starts & digits) | (minus << 1);
   uint64_t longRuns = digits;  // bits that start 16 digits in a row
   for (int shift = 1; shift < 16; shift *= 2) longRuns &= longRuns >> shift;
-  const bool shape =
-      // Between the braces, outside the strings, only the bytes of numbers and separators.
-      (outside & ~(b.quote | colons | commas | minus | digits)) == (last | 1) &&
-      // Each name opens right after "{" or a comma, and closes right before its colon.
-      opening == ((commas << 1) | 2) && (closing << 1) == colons &&
-      // Each value is then a number: a sign only at its start, a digit before the comma
-      // or brace that ends it; no leading zero, at most 15 digits.
-      (minus & ~starts) == 0 && (((commas | last) >> 1) & ~digits) == 0 &&
-      ((firstDigits & b.zero) << 1 & digits) == 0 && longRuns == 0;
-  return shape ? object + __builtin_ctzll(last) + 1 : nullptr;
+  return (b.close & last) != 0 && ((b.backslash | b.newline) & within) == 0 &&
+         // Between the braces, outside the strings, only the bytes of numbers and separators.
+         (outside & ~(b.quote | colons | commas | minus | digits)) == (last | 1) &&
+         // Each name opens right after "{" or a comma, and closes right before its colon.
+         opening == ((commas << 1) | 2) && (closing << 1) == colons &&
+         // Each value is then a number: a sign only at its start, a digit before the comma
+         // or brace that ends it; no leading zero, at most 15 digits.
+         (minus & ~starts) == 0 && (((commas | last) >> 1) & ~digits) == 0 &&
+         ((firstDigits & b.zero) << 1 & digits) == 0 && longRuns == 0;
+}
+
+// Without a backslash in the object, quotes pair up: a byte is inside a string when an
+// odd number of quotes precede it or sit on it (an opening quote is inside, a closing
+// quote outside).
+inline __attribute__((always_inline)) uint64_t InString(uint64_t quotes) {
+  for (int shift = 1; shift < 64; shift *= 2) quotes ^= quotes << shift;
+  return quotes;
+}
+
+// The end of the object whose "{" is the first of the 64 bytes, when it lies within them
+// and is a flat object of numbers; null otherwise.
+inline __attribute__((always_inline)) const char* FlatNumbersEnd(const char* object, const ObjectBytes& b) {
+  const uint64_t inString = InString(b.quote);
+  const uint64_t closes = b.close & ~inString;
+  const uint64_t last = closes & (~closes + 1);
+  return closes != 0 && FlatNumbers(b, inString, last) ? object + __builtin_ctzll(last) + 1 : nullptr;
 }
 
 #if defined(__x86_64__) && defined(__GNUC__)
@@ -776,10 +784,11 @@ __attribute__((target("avx512bw"))) const char* FlatNumbersAvx512(const char* ob
 // for the object's check; ok tells whether the object and the line's end are as said.
 __attribute__((target("avx512bw"))) const char* FlatNumbersLineEndAvx512(const char* object, bool& ok) {
   const ObjectBytes b = ObjectBytesAvx512(object);
-  const char* newline = object + __builtin_ctzll(b.newline | (uint64_t(1) << 63));
-  const char* end = FlatNumbersEnd(object, b);
-  ok = b.newline != 0 && end != nullptr && *end == '}' && end + 1 == newline;
-  return newline;
+  // The object's "}" and the line's are the two bytes before the first newline: where the
+  // object ends is known without finding its strings first.
+  const uint64_t last = (b.newline & (~b.newline + 1)) >> 2;
+  ok = (b.close & (last << 1)) != 0 && FlatNumbers(b, InString(b.quote), last);
+  return object + __builtin_ctzll(b.newline | (uint64_t(1) << 63));
 }
 
 // Elsewhere objects are read member by member: with narrower vectors, building the masks
@@ -867,11 +876,16 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
     return std::memcmp(p, "false", 5) == 0 ? p + 5 : nullptr;
   };
 
+#ifdef FIDX_HAVE_FLAT_NUMBERS
+  // Whether the object whose "{" is at p is read at once: the processor can, and its 64
+  // bytes lie within the span.
+  auto atOnce = [&](const char* p) { return kHaveFlatNumbers && p + 64 <= line + kSpan; };
+#endif
   // A flat object of numbers read at once where the processor can, from its "{"; the
   // position after it, or null to read it member by member.
   auto flatNumbers = [&](const char* p) -> const char* {
 #ifdef FIDX_HAVE_FLAT_NUMBERS
-    if (kHaveFlatNumbers && p + 64 <= line + kSpan) return FlatNumbersAvx512(p);
+    if (atOnce(p)) return FlatNumbersAvx512(p);
 #else
     static_cast<void>(p);
 #endif
@@ -959,7 +973,7 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
       p += sizeof(kData) - 1;
 #ifdef FIDX_HAVE_FLAT_NUMBERS
       // Last in the line, a flat object of numbers need not hold up the next line.
-      if (kHaveFlatNumbers && *p == '{' && p + 64 <= line + kSpan && p[1] != '}') {
+      if (*p == '{' && p[1] != '}' && atOnce(p)) {
         bool ok;
         const char* newline = FlatNumbersLineEndAvx512(p, ok);
         if (ok && newline < limit) {
