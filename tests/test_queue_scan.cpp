@@ -76,7 +76,9 @@ QueueLineKind ExpectAlike(const std::string& line, size_t* valid = nullptr, std:
   const char *end = nullptr, *byRunEnd = nullptr;
   const QueueLineKind kind = internal::ClassifyQueueLine(line.data(), line.data() + line.size(), view, end);
   EXPECT_EQ(internal::ViewQueueLine(line.data(), line.size(), alone), kind == QueueLineKind::kEvent) << what;
-  internal::QueueRunClassifier longReader(longRun.data(), longRun.data() + longRun.size());
+  internal::QueueRunClassifier longReader(longRun.data(), longRun.data() + longRun.size()),
+      unread(longRun.data(), longRun.data() + longRun.size());
+  EXPECT_EQ(unread.Classify(longRun.data(), byRun, byRunEnd, internal::QueuePaths::kUnread), kind) << what;
   EXPECT_EQ(longReader.Classify(longRun.data(), byRun, byRunEnd), kind) << what;
   EXPECT_FALSE(kind == QueueLineKind::kNotEvent && ok) << "refused an event: " << what;
   if (valid) *valid += ok;
@@ -115,6 +117,7 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
        {R"({"event":1.5,"path":"/a"})", R"({"event":8,"path":"/a","data":{7,"a":2}})",
         R"({"event":8,"path":"/a","data":{"a":1}])", R"({"event":8,"path":"/a","data":{"a":1]})",
         R"({"event":-0,"path":"/a"})", R"({"\u0065vent":2,"path":"/a"})", R"({"event":2,"path":"/a\ud800"})",
+        R"({"event":2,"path":"/a\ud800\n0000/\ud800xu0000"})", R"({"event":2,"path":"/a\q"})",
         "{\"event\":2,\"path\":\"/a\"}\0/x"s,
         "{\"event\":2,\"path\":\"/a\",\"d\":" + std::string(5000, '[') + std::string(5000, ']') + "}"}}};
   std::string edited;
@@ -138,7 +141,7 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
     if (rng() % 2) text += LooseLine(rng, "/v");
     const std::vector<char> exact(text.begin(), text.end());  // the sanitizers see a read past the run
     const char* const end = exact.data() + exact.size();
-    internal::QueueRunClassifier run(exact.data(), end);
+    internal::QueueRunClassifier run(exact.data(), end), unread(exact.data(), end);
     for (const char* line = exact.data(); line < end; ++lines, line = std::find(line, end, '\n') + 1) {
       const std::string alone(line, std::find(line, end, '\n'));
       std::string shown;
@@ -147,6 +150,10 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
       const char* runEnd = nullptr;
       ASSERT_EQ(run.Classify(line, byRun, runEnd), kind) << ::testing::PrintToString(alone);
       EXPECT_TRUE(kind != QueueLineKind::kEvent || (runEnd == line + alone.size() && Show(byRun) == shown))
+          << ::testing::PrintToString(alone);
+      ASSERT_EQ(unread.Classify(line, byRun, runEnd, internal::QueuePaths::kUnread), kind)
+          << "paths unread: " << ::testing::PrintToString(alone);
+      EXPECT_TRUE(kind != QueueLineKind::kEvent || runEnd == line + alone.size())
           << ::testing::PrintToString(alone);
       events += kind == QueueLineKind::kEvent;
       refused += kind == QueueLineKind::kNotEvent;

@@ -94,6 +94,31 @@ FIDX_HOT size_t Digits16(const char* p) {
 
 bool IsHighSurrogate(unsigned code) { return code >= 0xD800 && code <= 0xDBFF; }
 
+// The position after the escape whose backslash is at p, checked as the general reading
+// checks it; null when the escape is not one (the general reading then tells why). Reads
+// at most 12 bytes from p.
+const char* SkipEscape(const char* p) {
+  unsigned code;
+  switch (p[1]) {
+    case '"':
+    case '\\':
+    case '/':
+    case 'b':
+    case 'f':
+    case 'n':
+    case 'r':
+    case 't':
+      return p + 2;
+    case 'u':
+      if (!Hex4(p + 2, code)) return nullptr;
+      if (!IsHighSurrogate(code)) return p + 6;
+      // The partner's form is checked, not its value.
+      return p[6] == '\\' && p[7] == 'u' && Hex4(p + 8, code) ? p + 12 : nullptr;
+    default:
+      return nullptr;
+  }
+}
+
 // The first quote, backslash or newline in [p, end), or end; the bytes from lineBegin on
 // may be read. Inside a string the quote and the backslash are the only bytes with a
 // meaning (the JSON library keeps raw control characters and any other byte as they
@@ -958,6 +983,17 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
       value = p;
       size = static_cast<size_t>(stop - p);
       return stop + 1;
+    }
+    // Unread, the escapes are only checked, here where they are common ones.
+    if (paths == QueuePaths::kUnread) {
+      const char* at = stop;
+      while (*at == '\\' && (at = SkipEscape(at)) != nullptr && (at = firstStop(at)) != nullptr) {
+        if (*at == '"') {
+          value = nullptr;
+          size = 0;
+          return at + 1;
+        }
+      }
     }
     stop = Reader(line, end_).ReadMember(p - 1, value, size, storage, paths);
     return stop != nullptr && stop < limit ? stop : nullptr;
