@@ -118,7 +118,7 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
         R"({"event":8,"path":"/a","data":{"a":1}])", R"({"event":8,"path":"/a","data":{"a":1]})",
         R"({"event":-0,"path":"/a"})", R"({"\u0065vent":2,"path":"/a"})", R"({"event":2,"path":"/a\ud800"})",
         R"({"event":2,"path":"/a\ud800\n0000/\ud800xu0000"})", R"({"event":2,"path":"/a\q"})",
-        "{\"event\":2,\"path\":\"/a\"}\0/x"s,
+        "{\"event\":2,\"path\":\"/a\"}\0/x"s, "{\"event\":2,\"path\":\"/a\\\0\"}"s,
         "{\"event\":2,\"path\":\"/a\",\"d\":" + std::string(5000, '[') + std::string(5000, ']') + "}"}}};
   std::string edited;
   for (const auto& [kind, lines] : table)

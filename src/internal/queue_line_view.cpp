@@ -94,29 +94,19 @@ FIDX_HOT size_t Digits16(const char* p) {
 
 bool IsHighSurrogate(unsigned code) { return code >= 0xD800 && code <= 0xDBFF; }
 
+// Whether the escape "\c" is one of those that stand for a single byte.
+bool IsShortEscape(char c) { return c != '\0' && std::strchr("\"\\/bfnrt", c) != nullptr; }
+
 // The position after the escape whose backslash is at p, checked as the general reading
 // checks it; null when the escape is not one (the general reading then tells why). Reads
 // at most 12 bytes from p.
 const char* SkipEscape(const char* p) {
+  if (p[1] != 'u') return IsShortEscape(p[1]) ? p + 2 : nullptr;
   unsigned code;
-  switch (p[1]) {
-    case '"':
-    case '\\':
-    case '/':
-    case 'b':
-    case 'f':
-    case 'n':
-    case 'r':
-    case 't':
-      return p + 2;
-    case 'u':
-      if (!Hex4(p + 2, code)) return nullptr;
-      if (!IsHighSurrogate(code)) return p + 6;
-      // The partner's form is checked, not its value.
-      return p[6] == '\\' && p[7] == 'u' && Hex4(p + 8, code) ? p + 12 : nullptr;
-    default:
-      return nullptr;
-  }
+  if (!Hex4(p + 2, code)) return nullptr;
+  if (!IsHighSurrogate(code)) return p + 6;
+  // The partner's form is checked, not its value.
+  return p[6] == '\\' && p[7] == 'u' && Hex4(p + 8, code) ? p + 12 : nullptr;
 }
 
 // The first quote, backslash or newline in [p, end), or end; the bytes from lineBegin on
@@ -478,29 +468,16 @@ class Reader {
   const char* Escape(const char* p) const {
     ++p;
     if (AtEnd(p)) return Stop(p);
-    switch (*p) {
-      case '"':
-      case '\\':
-      case '/':
-      case 'b':
-      case 'f':
-      case 'n':
-      case 'r':
-      case 't':
-        return p + 1;
-      case 'u': {
-        unsigned code;
-        p = HexDigits(p + 1, 4, code);
-        if (p == nullptr || !IsHighSurrogate(code)) return p;
-        for (char c : {'\\', 'u'}) {
-          if (!At(p, c)) return Stop(p);
-          ++p;
-        }
-        return HexDigits(p, 4, code);
-      }
-      default:
-        return Stop(p);
+    if (IsShortEscape(*p)) return p + 1;
+    if (*p != 'u') return Stop(p);
+    unsigned code;
+    p = HexDigits(p + 1, 4, code);
+    if (p == nullptr || !IsHighSurrogate(code)) return p;
+    for (char c : {'\\', 'u'}) {
+      if (!At(p, c)) return Stop(p);
+      ++p;
     }
+    return HexDigits(p, 4, code);
   }
 
   // At the opening quote. [begin, end) is the text between the quotes; escaped tells
