@@ -751,10 +751,11 @@ inline __attribute__((always_inline)) uint64_t InString(uint64_t quotes) {
 // The end of the object whose "{" is the first of the 64 bytes, when it lies within them
 // and is a flat object of numbers; null otherwise.
 inline __attribute__((always_inline)) const char* FlatNumbersEnd(const char* object, const ObjectBytes& b) {
-  const uint64_t inString = InString(b.quote);
-  const uint64_t closes = b.close & ~inString;
-  const uint64_t last = closes & (~closes + 1);
-  return closes != 0 && FlatNumbers(b, inString, last) ? object + __builtin_ctzll(last) + 1 : nullptr;
+  // The first "}" is taken for the object's end without finding the strings first, so
+  // that the end is known early; an object with a "}" in a name is refused by the check
+  // (that "}" lies inside a string) and read member by member.
+  const uint64_t last = b.close & (~b.close + 1);
+  return FlatNumbers(b, InString(b.quote), last) ? object + __builtin_ctzll(last) + 1 : nullptr;
 }
 
 #if defined(__x86_64__) && defined(__GNUC__)
