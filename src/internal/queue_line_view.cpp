@@ -265,18 +265,7 @@ class Reader {
   // escapes and is not to be decoded.
   const char* ReadMember(const char* p, const char*& value, size_t& size, std::string& storage,
                          QueuePaths paths) const {
-    if (paths == QueuePaths::kRead) return Member(p, value, size, storage);
-    const char* begin;
-    const char* end;
-    bool escaped;
-    p = String(p, begin, end, escaped, true);
-    value = nullptr;
-    size = 0;
-    if (p != nullptr && !escaped) {
-      value = begin;
-      size = static_cast<size_t>(end - begin);
-    }
-    return p;
+    return Member(p, value, size, storage, paths);
   }
 
   QueueLineKind Line(QueueEventView& out, const char*& lineEnd) const {
@@ -501,14 +490,19 @@ class Reader {
     }
   }
 
-  // A string member that is read: its value, decoded into storage when it has escapes.
-  FIDX_HOT const char* Member(const char* p, const char*& value, size_t& size, std::string& storage) const {
+  // A string member that is read: its value, decoded into storage when it has escapes,
+  // or null and 0 when it has escapes and its paths are unread.
+  FIDX_HOT const char* Member(const char* p, const char*& value, size_t& size, std::string& storage,
+                              QueuePaths paths = QueuePaths::kRead) const {
     const char* begin;
     const char* end;
     bool escaped;
     p = String(p, begin, end, escaped, true);
     if (p == nullptr) return nullptr;
-    if (escaped) {
+    if (escaped && paths == QueuePaths::kUnread) {
+      value = nullptr;
+      size = 0;
+    } else if (escaped) {
       Decode(begin, end, storage);
       value = storage.data();
       size = storage.size();
@@ -837,9 +831,8 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
   // Each step reads at most kReach bytes from a position before limit.
   const char* const limit = line + kSpan - kReach;
   // The first quote, backslash or newline in [p, limit); stringEnd takes only a quote,
-  // the end of a string without escapes.
-  // Two words are looked at before any branch: whether a path ends in the word where it
-  // starts or in the next one is as good as random.
+  // the end of a string without escapes. Two words are looked at before any branch:
+  // whether a path ends in the word where it starts or in the next one is as good as random.
   auto firstStop = [&](const char* p) -> const char* {
     const size_t at = static_cast<size_t>(p - window_);
     size_t word = at / 64;
