@@ -12,9 +12,10 @@
 namespace {
 
 struct Figure {
-  double seconds = 0;      // real time per iteration
-  double bytesPerSec = 0;  // 0 when the benchmark reads no file
-  double share = 0;        // a paired benchmark's median share of its reference's speed
+  double seconds = 0;               // real time per iteration
+  double bytesPerSec = 0;           // 0 when the benchmark reads no file
+  double share = 0;                 // a paired benchmark's median share of its reference's speed
+  double shareQ1 = 0, shareQ3 = 0;  // and the quartiles around it
   double pairs = 0;
   bool failed = false;
 };
@@ -36,6 +37,10 @@ class SummaryReporter : public benchmark::ConsoleReporter {
       if (bytes != run.counters.end()) figure.bytesPerSec = bytes->second.value;
       auto share = run.counters.find("share");
       if (share != run.counters.end()) figure.share = share->second.value;
+      auto q1 = run.counters.find("share_q1");
+      if (q1 != run.counters.end()) figure.shareQ1 = q1->second.value;
+      auto q3 = run.counters.find("share_q3");
+      if (q3 != run.counters.end()) figure.shareQ3 = q3->second.value;
       auto pairs = run.counters.find("pairs");
       if (pairs != run.counters.end()) figure.pairs = pairs->second.value;
       // "<scenario>/<variant>", followed by what the library appends ("/real_time").
@@ -64,7 +69,8 @@ class SummaryReporter : public benchmark::ConsoleReporter {
         }
         if (figure.share > 0)
           ratio = Printf("%.2f of read_count_lines's speed", figure.share) +
-                  Printf(" (median of %.0f pairs)", figure.pairs);
+                  Printf(" (median of %.0f pairs,", figure.pairs) +
+                  Printf(" middle half %.2f", figure.shareQ1) + Printf(" to %.2f)", figure.shareQ3);
         std::printf("%-28s %-15s %12s %12s  %s\n", scenario.c_str(), entry.first.c_str(),
                     figure.failed ? "FAILED" : Rate(figure).c_str(), Time(figure.seconds).c_str(),
                     ratio.c_str());
