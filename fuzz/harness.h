@@ -287,8 +287,13 @@ inline std::string CheckQueueRun(const uint8_t* data, size_t size) {
     const char* next = std::find(line, end, '\n');
     if (kind != fi::internal::ClassifyQueueLine(line, end, alone, aloneEnd))
       return "QueueRunClassifier decides otherwise than ClassifyQueueLine: " + Show(std::string(line, next));
-    if (unread.Classify(line, kindOnly, kindOnlyEnd, fi::internal::QueuePaths::kUnread) != kind ||
-        (kind == fi::internal::QueueLineKind::kEvent && kindOnlyEnd != runEnd))
+    // The paths-unread reading also reads flat objects by comparisons, where the processor
+    // has a faster way too.
+    fi::internal::UseFlatObjectReading(fi::internal::FlatObjectReading::kCompared);
+    const fi::internal::QueueLineKind kindUnread =
+        unread.Classify(line, kindOnly, kindOnlyEnd, fi::internal::QueuePaths::kUnread);
+    fi::internal::UseFlatObjectReading(fi::internal::BestFlatObjectReading());
+    if (kindUnread != kind || (kind == fi::internal::QueueLineKind::kEvent && kindOnlyEnd != runEnd))
       return "QueueRunClassifier decides otherwise when the paths are unread: " +
              Show(std::string(line, next));
     if (kind == fi::internal::QueueLineKind::kEvent &&

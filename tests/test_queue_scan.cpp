@@ -95,7 +95,7 @@ QueueLineKind ExpectAlike(const std::string& line, size_t* valid = nullptr, std:
 // (masks end mid-line, the last line may lack its newline) of every one-byte deletion and delimiter
 // insertion of the short lines (a dropped colon check in the run reader's flat-object loop showed
 // only there), then of generated lines: each reads alone as the parser reads it, and in its run alike.
-TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
+void ExpectLinesAndRunsAlike() {
   const std::pair<QueueLineKind, std::vector<std::string>> table[] = {
       {QueueLineKind::kEvent,
        {R"({"event":256,"path":"/v/q","path_old":"/v/p/a"})",
@@ -107,6 +107,7 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
         R"({"event":8,"path":"/a","data":{"a":"s","b":true,"c":null,"d":false}})",
         R"({"event":8,"path":"/a","data":{"a}":1,"b,:{":-0,"":123456789012345,"z":70}})",
         R"({"data":{"n":1234567890123456,"size":0},"event":2,"path":"/a"})",
+        R"({"data":{"":7,"m_T":-0},"event":2,"path":"/a"})", R"({"event":8,"path":"/a","data":{"x2":5}})",
         R"({"event":8,"path":"/a","data":{"inode":123456789,"size":123456789,"mtime":1700000000,"c":1}})",
         "{\"event\":2,\"path\":\"" + std::string(70000, 'l') + "\"}"}},
       {QueueLineKind::kNotEvent,
@@ -116,7 +117,9 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
       {QueueLineKind::kUndecided,
        {R"({"event":1.5,"path":"/a"})", R"({"event":8,"path":"/a","data":{7,"a":2}})",
         R"({"event":8,"path":"/a","data":{"a":1}])", R"({"event":8,"path":"/a","data":{"a":1]})",
-        R"({"event":-0,"path":"/a"})", R"({"\u0065vent":2,"path":"/a"})", R"({"event":2,"path":"/a\ud800"})",
+        R"({"event":8,"path":"/a","data":{"a":1b":2}})",
+        "{\"event\":8,\"path\":\"/a\",\"data\":{\"a\":1\xb1}}", R"({"event":-0,"path":"/a"})",
+        R"({"\u0065vent":2,"path":"/a"})", R"({"event":2,"path":"/a\ud800"})",
         R"({"event":2,"path":"/a\ud800\n0000/\ud800xu0000"})", R"({"event":2,"path":"/a\q"})",
         "{\"event\":2,\"path\":\"/a\"}\0/x"s, "{\"event\":2,\"path\":\"/a\\\0\"}"s,
         "{\"event\":2,\"path\":\"/a\",\"d\":" + std::string(5000, '[') + std::string(5000, ']') + "}"}}};
@@ -163,6 +166,19 @@ TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
   EXPECT_TRUE(valid > lines / 5 && valid < lines * 4 / 5 && events > valid / 5 &&
               refused > (lines - valid) / 5)
       << valid << " " << events << " " << refused << " of " << lines;
+}
+
+// Each way of reading flat objects that this processor has.
+TEST(QueueLineDifferential, LinesAndRunsReadAsTheParserReadsThem) {
+  const internal::FlatObjectReading best = internal::BestFlatObjectReading();
+  for (auto reading : {internal::FlatObjectReading::kMemberByMember, internal::FlatObjectReading::kCompared,
+                       internal::FlatObjectReading::kLookedUp}) {
+    if (reading > best) break;
+    SCOPED_TRACE(static_cast<int>(reading));
+    internal::UseFlatObjectReading(reading);
+    ExpectLinesAndRunsAlike();
+  }
+  internal::UseFlatObjectReading(best);
 }
 
 // Queues of generated lines answer the folder status and log as a plain scan would.

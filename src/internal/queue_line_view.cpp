@@ -701,101 +701,196 @@ void ComputeStopMasks(const char* p, size_t words, uint64_t* out) {
   StopMasks(p, words, out);
 }
 
-// Where the 64 bytes of an object hold each byte that a flat object of numbers is made of.
-struct ObjectBytes {
-  uint64_t quote, backslash, newline, colon, comma, minus, digit, zero, close;
-};
-
-// Whether the object whose "{" is the first of the 64 bytes, and whose "}" is at the bit
-// last, holds only members with plain names and numbers as the general reading takes them
-// (no leading zero, at most 15 digits, no fraction or exponent). inString marks the bytes
-// inside its strings. All its tokens are checked at once from the byte masks, with no step
-// waiting for the one before, which is where reading member by member spends its time.
-inline __attribute__((always_inline)) bool FlatNumbers(const ObjectBytes& b, uint64_t inString,
-                                                       uint64_t last) {
-  const uint64_t within = last | (last - 1);
-  const uint64_t outside = ~inString & within;
-  const uint64_t opening = b.quote & inString & within;
-  const uint64_t closing = b.quote & outside;
-  const uint64_t colons = b.colon & outside, commas = b.comma & outside;
-  const uint64_t minus = b.minus & outside, digits = b.digit & outside;
-  const uint64_t starts = colons << 1;  // where each value starts
-  const uint64_t firstDigits = (starts & digits) | (minus << 1);
-  uint64_t longRuns = digits;  // bits that start 16 digits in a row
-  for (int shift = 1; shift < 16; shift *= 2) longRuns &= longRuns >> shift;
-  return (b.close & last) != 0 && ((b.backslash | b.newline) & within) == 0 &&
-         // Between the braces, outside the strings, only the bytes of numbers and separators.
-         (outside & ~(b.quote | colons | commas | minus | digits)) == (last | 1) &&
-         // Each name opens right after "{" or a comma, and closes right before its colon.
-         opening == ((commas << 1) | 2) && (closing << 1) == colons &&
-         // Each value is then a number: a sign only at its start, a digit before the comma
-         // or brace that ends it; no leading zero, at most 15 digits.
-         (minus & ~starts) == 0 && (((commas | last) >> 1) & ~digits) == 0 &&
-         ((firstDigits & b.zero) << 1 & digits) == 0 && longRuns == 0;
-}
-
-// Without a backslash in the object, quotes pair up: a byte is inside a string when an
-// odd number of quotes precede it or sit on it (an opening quote is inside, a closing
-// quote outside).
-inline __attribute__((always_inline)) uint64_t InString(uint64_t quotes) {
-  for (int shift = 1; shift < 64; shift *= 2) quotes ^= quotes << shift;
-  return quotes;
-}
-
-// The end of the object whose "{" is the first of the 64 bytes, when it lies within them
-// and is a flat object of numbers; null otherwise.
-inline __attribute__((always_inline)) const char* FlatNumbersEnd(const char* object, const ObjectBytes& b) {
-  // The first "}" is taken for the object's end without finding the strings first, so
-  // that the end is known early; an object with a "}" in a name is refused by the check
-  // (that "}" lies inside a string) and read member by member.
-  const uint64_t last = b.close & (~b.close + 1);
-  return FlatNumbers(b, InString(b.quote), last) ? object + __builtin_ctzll(last) + 1 : nullptr;
-}
-
 #if defined(__x86_64__) && defined(__GNUC__)
 #define FIDX_HAVE_FLAT_NUMBERS 1
-// The masks of the 64 bytes at once, on processors that have AVX-512BW.
-__attribute__((target("avx512bw"), always_inline)) inline ObjectBytes ObjectBytesAvx512(const char* object) {
-  const __m512i bytes = _mm512_loadu_si512(object);
-#define FIDX_BYTES_EQUAL(c) _mm512_cmpeq_epi8_mask(bytes, _mm512_set1_epi8(c))
-  return {
-      FIDX_BYTES_EQUAL('"'),
-      FIDX_BYTES_EQUAL('\\'),
-      FIDX_BYTES_EQUAL('\n'),
-      FIDX_BYTES_EQUAL(':'),
-      FIDX_BYTES_EQUAL(','),
-      FIDX_BYTES_EQUAL('-'),
-      _mm512_cmplt_epu8_mask(_mm512_sub_epi8(bytes, _mm512_set1_epi8('0')), _mm512_set1_epi8(10)),
-      FIDX_BYTES_EQUAL('0'),
-      FIDX_BYTES_EQUAL('}'),
+// A flat object of numbers is read at once from its 64 bytes: "{", then members whose
+// names are made of letters and "_" and whose values are numbers as the general reading
+// takes them (no leading zero, at most 15 digits, no fraction or exponent), then "}".
+// Each byte gets a class, and the object is well formed when every byte is followed by
+// one that its class allows. With such names a byte's class is known from the byte and
+// its neighbour alone, without finding the strings first, so all bytes are checked at
+// once, with no step waiting for the one before. Objects with other names are read
+// member by member.
+namespace flat {
+
+enum Class : char {
+  kOther,  // no byte may follow it, and it may follow none
+  kOpening,
+  kClosing,
+  kLetter,
+  kColon,
+  kComma,
+  kMinus,
+  kDigit,
+  kBrace,
+};
+
+// Each class as one bit of a set, and the set of classes that may follow it; repeated in
+// each 16-byte lane for the byte shuffle.
+struct alignas(64) LaneTables {
+  char bit[64];
+  char followers[64];
+};
+constexpr LaneTables MakeLaneTables() {
+  LaneTables t{};
+  const unsigned char bit[16] = {0, 1, 2, 4, 8, 16, 32, 64, 128};
+  const unsigned opening = 1, closing = 2, letter = 4, colon = 8, comma = 16, minus = 32, digit = 64,
+                 brace = 128;
+  const unsigned char followers[16] = {
+      0,                      // kOther
+      letter | closing,       // kOpening: a name, or the empty name's end
+      colon,                  // kClosing
+      letter | closing,       // kLetter
+      minus | digit,          // kColon: a number
+      opening,                // kComma: the next name
+      digit,                  // kMinus
+      digit | comma | brace,  // kDigit
+      0,                      // kBrace: the end, where the check stops
   };
-#undef FIDX_BYTES_EQUAL
+  for (int i = 0; i < 64; ++i) {
+    t.bit[i] = static_cast<char>(bit[i % 16]);
+    t.followers[i] = static_cast<char>(followers[i % 16]);
+  }
+  return t;
+}
+constexpr LaneTables kLaneTables = MakeLaneTables();
+
+// The class of each ASCII byte, a quote taken as closing (the opening ones are marked
+// after).
+struct alignas(64) AsciiClasses {
+  char of[128];
+};
+constexpr AsciiClasses MakeAsciiClasses() {
+  AsciiClasses t{};
+  for (int c = 0; c < 128; ++c) {
+    char k = kOther;
+    if (c == '"') k = kClosing;
+    if (c == ':') k = kColon;
+    if (c == ',') k = kComma;
+    if (c == '-') k = kMinus;
+    if (c >= '0' && c <= '9') k = kDigit;
+    if (c == '}') k = kBrace;
+    if ((c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || c == '_') k = kLetter;
+    t.of[c] = k;
+  }
+  return t;
+}
+constexpr AsciiClasses kAsciiClasses = MakeAsciiClasses();
+
+// The 64 bytes at an object: their classes, and the masks the numbers' rules need.
+struct Bytes {
+  __m512i classes;
+  uint64_t quote, comma, colon, minus, digit, zero, close, newline;
+};
+
+#define FIDX_BYTES_EQUAL(c) _mm512_cmpeq_epi8_mask(bytes, _mm512_set1_epi8(c))
+__attribute__((target("avx512bw"), always_inline)) inline Bytes Masks(__m512i bytes, __m512i classes,
+                                                                      uint64_t digit) {
+  return {classes, FIDX_BYTES_EQUAL('"'), FIDX_BYTES_EQUAL(','), FIDX_BYTES_EQUAL(':'), FIDX_BYTES_EQUAL('-'),
+          digit,   FIDX_BYTES_EQUAL('0'), FIDX_BYTES_EQUAL('}'), FIDX_BYTES_EQUAL('\n')};
 }
 
-__attribute__((target("avx512bw"))) const char* FlatNumbersAvx512(const char* object) {
-  return FlatNumbersEnd(object, ObjectBytesAvx512(object));
+// The classes by one comparison each, on processors with AVX-512BW.
+__attribute__((target("avx512bw"), always_inline)) inline Bytes ClassifyCompared(const char* object) {
+  const __m512i bytes = _mm512_loadu_si512(object);
+  const uint64_t digit =
+      _mm512_cmplt_epu8_mask(_mm512_sub_epi8(bytes, _mm512_set1_epi8('0')), _mm512_set1_epi8(10));
+  const uint64_t letter =
+      _mm512_cmplt_epu8_mask(
+          _mm512_sub_epi8(_mm512_or_si512(bytes, _mm512_set1_epi8(0x20)), _mm512_set1_epi8('a')),
+          _mm512_set1_epi8(26)) |
+      FIDX_BYTES_EQUAL('_');
+  __m512i classes = _mm512_maskz_mov_epi8(FIDX_BYTES_EQUAL('"'), _mm512_set1_epi8(kClosing));
+  classes = _mm512_mask_mov_epi8(classes, FIDX_BYTES_EQUAL(':'), _mm512_set1_epi8(kColon));
+  classes = _mm512_mask_mov_epi8(classes, FIDX_BYTES_EQUAL(','), _mm512_set1_epi8(kComma));
+  classes = _mm512_mask_mov_epi8(classes, FIDX_BYTES_EQUAL('-'), _mm512_set1_epi8(kMinus));
+  classes = _mm512_mask_mov_epi8(classes, digit, _mm512_set1_epi8(kDigit));
+  classes = _mm512_mask_mov_epi8(classes, FIDX_BYTES_EQUAL('}'), _mm512_set1_epi8(kBrace));
+  classes = _mm512_mask_mov_epi8(classes, letter, _mm512_set1_epi8(kLetter));
+  return Masks(bytes, classes, digit);
+}
+
+// The classes by one table lookup, on processors that also have AVX-512VBMI.
+__attribute__((target("avx512bw,avx512vbmi"), always_inline)) inline Bytes ClassifyLookedUp(
+    const char* object) {
+  const __m512i bytes = _mm512_loadu_si512(object);
+  // The lookup reads seven bits of the byte; the others are no ASCII byte.
+  const __m512i classes =
+      _mm512_maskz_permutex2var_epi8(~_mm512_movepi8_mask(bytes), _mm512_load_si512(kAsciiClasses.of), bytes,
+                                     _mm512_load_si512(kAsciiClasses.of + 64));
+  return Masks(bytes, classes, _mm512_cmpeq_epi8_mask(classes, _mm512_set1_epi8(kDigit)));
+}
+#undef FIDX_BYTES_EQUAL
+
+// Whether the object whose "{" is the first byte and whose "}" is at the bit last is a
+// flat object of numbers.
+__attribute__((target("avx512bw"), always_inline)) inline bool Valid(const Bytes& b, uint64_t last) {
+  // A quote right after "{" or a comma opens a name; every other one closes one.
+  const uint64_t opening = b.quote & ((b.comma << 1) | 2);
+  const __m512i classes = _mm512_mask_mov_epi8(b.classes, opening, _mm512_set1_epi8(kOpening));
+  const __m512i followers = _mm512_shuffle_epi8(_mm512_load_si512(kLaneTables.followers), classes);
+  const __m512i bits = _mm512_shuffle_epi8(_mm512_load_si512(kLaneTables.bit), classes);
+  // Each byte's class bit moved down onto the byte before it: the next 16-byte lane
+  // moved down, then each lane shifted by one byte with the start of the next (the masked
+  // form of the lane move, as GCC 12 warns on the plain one).
+  const __m512i nextLanes = _mm512_maskz_alignr_epi64(0xFF, _mm512_setzero_si512(), bits, 2);
+  const __m512i next = _mm512_alignr_epi8(nextLanes, bits, 1);
+  const uint64_t unfollowed = _mm512_testn_epi8_mask(followers, next);
+  const uint64_t inner = (last - 1) & ~uint64_t(1);  // between the braces
+  const uint64_t digits = b.digit & inner;
+  const uint64_t firstDigits = ((b.colon | b.minus) << 1) & digits;
+  uint64_t longRuns = digits;  // bits that start 16 digits in a row
+  for (int shift = 1; shift < 16; shift *= 2) longRuns &= longRuns >> shift;
+  // The "}" at last, each byte before it followed as its class allows, a name first,
+  // then the numbers' own rules.
+  return (b.close & last) != 0 &&
+         ((unfollowed & inner) | (~opening & 2) | ((firstDigits & b.zero) << 1 & digits) | longRuns) == 0;
+}
+
+// The end of the object when its first "}" ends it and it is a flat object of numbers;
+// null otherwise.
+__attribute__((target("avx512bw"), always_inline)) inline const char* End(const char* object,
+                                                                          const Bytes& b) {
+  const uint64_t last = b.close & (~b.close + 1);
+  return Valid(b, last) ? object + __builtin_ctzll(last) + 1 : nullptr;
 }
 
 // For an object that must end its line ("}" and the newline right after it): where the
 // newline is, taken from its mask alone, so that reading the next line need not wait
 // for the object's check; ok tells whether the object and the line's end are as said.
-__attribute__((target("avx512bw"))) const char* FlatNumbersLineEndAvx512(const char* object, bool& ok) {
-  const ObjectBytes b = ObjectBytesAvx512(object);
-  // The object's "}" and the line's are the two bytes before the first newline: where the
-  // object ends is known without finding its strings first.
+__attribute__((target("avx512bw"), always_inline)) inline const char* LineEnd(const char* object,
+                                                                              const Bytes& b, bool& ok) {
+  // The object's "}" and the line's are the two bytes before the first newline.
   const uint64_t last = (b.newline & (~b.newline + 1)) >> 2;
-  ok = (b.close & (last << 1)) != 0 && FlatNumbers(b, InString(b.quote), last);
+  ok = (b.close & (last << 1)) != 0 && Valid(b, last);
   return object + __builtin_ctzll(b.newline | (uint64_t(1) << 63));
 }
 
-// Elsewhere objects are read member by member: with narrower vectors, building the masks
-// costs what reading at once saves.
-bool HaveFlatNumbers() {
-  // Called from a static initializer: the processor's features may not be read yet.
-  __builtin_cpu_init();
-  return __builtin_cpu_supports("avx512bw");
+__attribute__((target("avx512bw"))) const char* EndCompared(const char* object) {
+  return End(object, ClassifyCompared(object));
 }
-const bool kHaveFlatNumbers = HaveFlatNumbers();
+__attribute__((target("avx512bw,avx512vbmi"))) const char* EndLookedUp(const char* object) {
+  return End(object, ClassifyLookedUp(object));
+}
+__attribute__((target("avx512bw"))) const char* LineEndCompared(const char* object, bool& ok) {
+  return LineEnd(object, ClassifyCompared(object), ok);
+}
+__attribute__((target("avx512bw,avx512vbmi"))) const char* LineEndLookedUp(const char* object, bool& ok) {
+  return LineEnd(object, ClassifyLookedUp(object), ok);
+}
+
+}  // namespace flat
+
+// The reading in use; see UseFlatObjectReading.
+FlatObjectReading flatReading = BestFlatObjectReading();
+
+const char* FlatNumbersAvx512(const char* object) {
+  return flatReading == FlatObjectReading::kLookedUp ? flat::EndLookedUp(object) : flat::EndCompared(object);
+}
+const char* FlatNumbersLineEndAvx512(const char* object, bool& ok) {
+  return flatReading == FlatObjectReading::kLookedUp ? flat::LineEndLookedUp(object, ok)
+                                                     : flat::LineEndCompared(object, ok);
+}
 #endif
 
 // The longest line read from the masks, and what every step below may read after its
@@ -875,7 +970,9 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
 #ifdef FIDX_HAVE_FLAT_NUMBERS
   // Whether the object whose "{" is at p is read at once: the processor can, and its 64
   // bytes lie within the span.
-  auto atOnce = [&](const char* p) { return kHaveFlatNumbers && p + 64 <= line + kSpan; };
+  auto atOnce = [&](const char* p) {
+    return flatReading != FlatObjectReading::kMemberByMember && p + 64 <= line + kSpan;
+  };
 #endif
   // A flat object of numbers read at once where the processor can, from its "{"; the
   // position after it, or null to read it member by member.
@@ -1000,6 +1097,26 @@ bool QueueRunClassifier::Common(const char* line, QueueEventView& out, const cha
   out.event = static_cast<unsigned>(event);
   lineEnd = p + 1;
   return true;
+}
+
+FlatObjectReading BestFlatObjectReading() {
+#ifdef FIDX_HAVE_FLAT_NUMBERS
+  // Also called from a static initializer: the processor's features may not be read yet.
+  // Without AVX-512 objects are read member by member: with narrower vectors, finding
+  // the classes costs what reading at once saves.
+  __builtin_cpu_init();
+  if (__builtin_cpu_supports("avx512bw"))
+    return __builtin_cpu_supports("avx512vbmi") ? FlatObjectReading::kLookedUp : FlatObjectReading::kCompared;
+#endif
+  return FlatObjectReading::kMemberByMember;
+}
+
+void UseFlatObjectReading(FlatObjectReading reading) {
+#ifdef FIDX_HAVE_FLAT_NUMBERS
+  if (reading <= BestFlatObjectReading()) flatReading = reading;
+#else
+  static_cast<void>(reading);
+#endif
 }
 
 QueueLineKind ClassifyQueueLine(const char* data, const char* limit, QueueEventView& out,

@@ -55,6 +55,18 @@ QueueLineKind ClassifyQueueLine(const char* data, const char* limit, QueueEventV
 // decoding a path with escapes is then left out.
 enum class QueuePaths { kRead, kUnread };
 
+// How the run reader reads a flat object of numbers ("data" as the daemons write it): at
+// once, with the processor's widest vectors where it has them, or member by member.
+enum class FlatObjectReading {
+  kMemberByMember,
+  kCompared,  // AVX-512BW: each byte's class found by comparisons
+  kLookedUp,  // AVX-512VBMI as well: by one table lookup
+};
+// The best this processor has, used unless a test asks for another.
+FlatObjectReading BestFlatObjectReading();
+// For tests, which read their lines each way the processor can: at most the best.
+void UseFlatObjectReading(FlatObjectReading reading);
+
 // ClassifyQueueLine for each line of a run of whole lines, as QueueLineReader::NextLines
 // hands them out, asked front to back. The line as the daemon writes it is read from bit
 // masks of the run's quotes, backslashes and newlines, computed a few kilobytes at a time
