@@ -33,16 +33,15 @@ class SummaryReporter : public benchmark::ConsoleReporter {
       figure.failed = run.error_occurred;
       if (run.iterations > 0)
         figure.seconds = run.real_accumulated_time / static_cast<double>(run.iterations);
-      auto bytes = run.counters.find("bytes_per_second");
-      if (bytes != run.counters.end()) figure.bytesPerSec = bytes->second.value;
-      auto share = run.counters.find("share");
-      if (share != run.counters.end()) figure.share = share->second.value;
-      auto q1 = run.counters.find("share_q1");
-      if (q1 != run.counters.end()) figure.shareQ1 = q1->second.value;
-      auto q3 = run.counters.find("share_q3");
-      if (q3 != run.counters.end()) figure.shareQ3 = q3->second.value;
-      auto pairs = run.counters.find("pairs");
-      if (pairs != run.counters.end()) figure.pairs = pairs->second.value;
+      auto counter = [&](const char* name) {
+        auto found = run.counters.find(name);
+        return found == run.counters.end() ? 0.0 : found->second.value;
+      };
+      figure.bytesPerSec = counter("bytes_per_second");
+      figure.share = counter("share");
+      figure.shareQ1 = counter("share_q1");
+      figure.shareQ3 = counter("share_q3");
+      figure.pairs = counter("pairs");
       // "<scenario>/<variant>", followed by what the library appends ("/real_time").
       const std::string name = run.benchmark_name();
       const std::string::size_type slash = name.find('/');
@@ -68,9 +67,8 @@ class SummaryReporter : public benchmark::ConsoleReporter {
           ratio = speedup >= 1 ? Printf("%.1fx faster", speedup) : Printf("%.2fx slower", 1 / speedup);
         }
         if (figure.share > 0)
-          ratio = Printf("%.2f of read_count_lines's speed", figure.share) +
-                  Printf(" (median of %.0f pairs,", figure.pairs) +
-                  Printf(" middle half %.2f", figure.shareQ1) + Printf(" to %.2f)", figure.shareQ3);
+          ratio = Printf("%.2f of read_count_lines's speed (median of %.0f pairs, middle half %.2f to %.2f)",
+                         figure.share, figure.pairs, figure.shareQ1, figure.shareQ3);
         std::printf("%-28s %-15s %12s %12s  %s\n", scenario.c_str(), entry.first.c_str(),
                     figure.failed ? "FAILED" : Rate(figure).c_str(), Time(figure.seconds).c_str(),
                     ratio.c_str());
@@ -97,9 +95,10 @@ class SummaryReporter : public benchmark::ConsoleReporter {
     }
     return nullptr;
   }
-  static std::string Printf(const char* fmt, double value) {
-    char buffer[64];
-    std::snprintf(buffer, sizeof(buffer), fmt, value);
+  template <typename... Values>
+  static std::string Printf(const char* fmt, Values... values) {
+    char buffer[128];
+    std::snprintf(buffer, sizeof(buffer), fmt, values...);
     return buffer;
   }
   static std::string Rate(const Figure& figure) {
